@@ -1,0 +1,25 @@
+# Entry points: `make test` installs what is missing, builds and runs every test;
+# `make asan` / `make tsan` do the same under the sanitizers in their own build folders.
+BUILD ?= build
+JOBS ?= $(shell nproc)
+
+.PHONY: deps build test asan tsan clean
+
+deps:
+	bash scripts/install-deps.sh
+
+build: deps
+	cmake -S . -B $(BUILD) $(CMAKE_ARGS)
+	cmake --build $(BUILD) -j $(JOBS)
+
+test: build
+	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
+
+asan:
+	$(MAKE) test BUILD=build-asan CMAKE_ARGS="-DORVANE_ASAN=ON -DORVANE_BENCH=OFF"
+
+tsan:
+	$(MAKE) test BUILD=build-tsan CMAKE_ARGS="-DORVANE_TSAN=ON -DORVANE_BENCH=OFF"
+
+clean:
+	rm -rf build build-asan build-tsan

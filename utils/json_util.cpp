@@ -1,0 +1,1 @@
+#include "utils/json_util.h"

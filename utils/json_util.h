@@ -1,0 +1,23 @@
+#ifndef ORVANE_UTILS_JSON_UTIL_H
+#define ORVANE_UTILS_JSON_UTIL_H
+
+#include <json/json.h>
+
+#include <map>
+#include <string>
+
+namespace android {
+namespace Orvane {
+namespace JsonUtil {
+
+bool ConvertStrToJson(const std::string& text, Json::Value& out);
+// An empty map is a failure and leaves `out` untouched.
+bool ConvertMapToJson(const std::map<std::string, std::string>& map, Json::Value& out);
+// One line, no indentation, three significant digits for floating values.
+std::string ConvertJsonToStr(const Json::Value& value);
+
+}  // namespace JsonUtil
+}  // namespace Orvane
+}  // namespace android
+
+#endif  // ORVANE_UTILS_JSON_UTIL_H
