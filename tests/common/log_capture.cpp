@@ -23,10 +23,12 @@ void Record(int priority, const char* tag, const char* message) {
 void CaptureLogger(const struct __android_log_message* message) {
     Record(message->priority, message->tag, message->message);
 }
+#define DEFAULT_LOGGER __android_log_logd_logger
 #else
 void CaptureLogger(const struct __android_logger_data* data, const char* message) {
     Record(data->priority, data->tag, message);
 }
+#define DEFAULT_LOGGER __android_log_stderr_logger
 #endif
 
 }  // namespace
@@ -42,6 +44,7 @@ LogCapture::LogCapture() {
 }
 
 LogCapture::~LogCapture() {
+    __android_log_set_logger(DEFAULT_LOGGER);
     std::lock_guard<std::mutex> lock(gMutex);
     gActive = false;
     gLines.clear();
