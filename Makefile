@@ -1,9 +1,10 @@
-# Entry points: `make test` installs what is missing, builds and runs every test;
-# `make asan` / `make tsan` do the same under the sanitizers in their own build folders.
+# Entry points: `make demo` runs the daemon's main job on this host; `make test` installs what is
+# missing, builds and runs every test; `make asan` / `make tsan` do the same under the sanitizers
+# in their own build folders.
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: deps build test asan tsan clean
+.PHONY: deps build demo test asan tsan clean
 
 deps:
 	bash scripts/install-deps.sh
@@ -11,6 +12,9 @@ deps:
 build: deps
 	cmake -S . -B $(BUILD) $(CMAKE_ARGS)
 	cmake --build $(BUILD) -j $(JOBS)
+
+demo: build
+	bash scripts/demo.sh $(BUILD)
 
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
