@@ -10,6 +10,9 @@ namespace android {
 namespace Orvane {
 namespace FileUtil {
 
+// Stateless helpers for files and folders, safe to call from any thread. Failures are reported
+// by the result and logged; nothing throws.
+
 // Creates the path and its missing parents; only the folders this call creates get `mode`.
 bool CreateDirectory(const std::string& path, mode_t mode);
 bool CreateDirectoryWithOwner(const std::string& path, uid_t uid, gid_t gid);
@@ -18,14 +21,19 @@ bool IsDirectory(const std::string& path);
 bool FileExists(const std::string& path);
 bool CheckFilePermission(const std::string& path, int accessMask);
 int64_t GetFileSize(const std::string& path);
-// Whole file into `content` (NULs trimmed at both ends); files over 32 MiB are refused.
+// Whole file into `content` (NULs trimmed at both ends); files over 32 MiB are refused and
+// `content` is left untouched on every failure.
 bool LoadStringFromFile(const std::string& path, std::string& content);
+// Empty content succeeds without creating or touching the file; `truncate` false appends.
 bool SaveStringToFile(const std::string& path, const std::string& content, bool truncate);
 void DeleteFile(const std::string& path);
 bool MoveFile(const std::string& oldPath, const std::string& newPath);
 // True when A's modification time (whole seconds) is not older than B's.
 bool IsFileLatest(const std::string& pathA, const std::string& pathB);
-// Deletes a file or a folder tree, adding the freed bytes to `total`; 0 on success.
+// Deletes a file or a folder tree; 0 on success, -1 at the first failure (what was removed
+// before stays removed). For a plain file `total` is set to its size; for a folder the sizes of
+// its files, of every subfolder and of the folder itself are added to `total`. With
+// `removeSelf` false an emptied folder is kept.
 int32_t DeleteDirectoryOrFile(const std::string& path, uint64_t& total, bool removeSelf);
 
 }  // namespace FileUtil

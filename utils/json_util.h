@@ -10,8 +10,11 @@ namespace android {
 namespace Orvane {
 namespace JsonUtil {
 
+// Stateless conversions; safe to call from any thread.
+// True only when the text parses without any reported error (errors are logged).
 bool ConvertStrToJson(const std::string& text, Json::Value& out);
-// An empty map is a failure and leaves `out` untouched.
+// Sets out[key] = value for every pair. An empty map, or an `out` that is neither null nor an
+// object, is a failure and leaves `out` untouched.
 bool ConvertMapToJson(const std::map<std::string, std::string>& map, Json::Value& out);
 // One line, no indentation, three significant digits for floating values.
 std::string ConvertJsonToStr(const Json::Value& value);

@@ -8,7 +8,7 @@ namespace Orvane {
 namespace TimeUtil {
 namespace {
 
-// Local midnight of `seconds` through the reentrant breakdown; false when it fails.
+// Local midnight of `seconds` through the reentrant conversions; false when either fails.
 bool LocalMidnight(time_t seconds, time_t& midnight) {
     struct tm local;
     if (localtime_r(&seconds, &local) == nullptr) {
@@ -17,8 +17,10 @@ bool LocalMidnight(time_t seconds, time_t& midnight) {
     local.tm_hour = 0;
     local.tm_min = 0;
     local.tm_sec = 0;
+    // Midnight may lie on the other side of a daylight-saving change than `seconds`.
+    local.tm_isdst = -1;
     midnight = mktime(&local);
-    return true;
+    return midnight != static_cast<time_t>(-1);
 }
 
 }  // namespace
