@@ -14,17 +14,6 @@
 
 #include "tests/common/log_capture.h"
 
-#if defined(__SANITIZE_THREAD__)
-// libutils is not built for ThreadSanitizer, so it cannot see that RefBase's reference count
-// (release decrement, acquire fence) orders every access before the delete. Objects freed by
-// the last decStrong on another thread than their last user are therefore reported as races:
-// a loop's ThreadImpl freed by the platform thread after ~EventLoop dropped it, an event and
-// handler freed with a finished entry after the waiting caller dropped its own references.
-extern "C" const char* __tsan_default_suppressions() {
-    return "race:android::RefBase::decStrong\n";
-}
-#endif
-
 namespace android {
 namespace Orvane {
 namespace {

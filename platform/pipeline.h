@@ -1,0 +1,56 @@
+#ifndef ORVANE_PLATFORM_PIPELINE_H
+#define ORVANE_PLATFORM_PIPELINE_H
+
+#include <memory>
+#include <mutex>
+#include <set>
+#include <string>
+#include <vector>
+
+#include <utils/RefBase.h>
+#include <utils/StrongPointer.h>
+
+#include "platform/event.h"
+#include "platform/plugin.h"
+
+namespace android {
+namespace Orvane {
+
+// An ordered list of plugins that an event passes, each step on the loop of its plugin, and the
+// listener plugins told once the last one has handled it. The processors are fixed at
+// construction. `listenersLock_` guards the listener set, which is replaced as a whole on each
+// registration, so a step in flight keeps the set it started with. Always hold a pipeline
+// through sp<Pipeline>: a step queued on a loop keeps its pipeline alive.
+class Pipeline : public virtual RefBase {
+public:
+    Pipeline(const std::string& name, const std::vector<sp<Plugin>>& plugins);
+
+    // Only the first plugin decides; a pipeline without plugins accepts nothing.
+    bool CanProcessEvent(sp<Event> event);
+    // Runs step `index` on the right thread: directly when the plugin has no loop or shares it
+    // with the previous step, else as a task on the plugin's loop.
+    void ProcessPipeline(sp<Event> event, unsigned int index);
+    // Runs step `index` here, then the next step or the listeners.
+    void ProcessEvent(sp<Event> event, unsigned int index);
+    // A listener already present is not added again.
+    void RegisterPluginListener(sp<Plugin> listener);
+
+    const std::string& GetName() const { return name_; }
+    const std::vector<sp<Plugin>>& GetPlugins() const { return plugins_; }
+    std::set<sp<Plugin>> GetListeners() const;
+
+private:
+    using ListenerSet = std::set<sp<Plugin>>;
+
+    std::shared_ptr<const ListenerSet> CurrentListeners() const;
+
+    const std::string name_;
+    const std::vector<sp<Plugin>> plugins_;
+    mutable std::mutex listenersLock_;
+    std::shared_ptr<const ListenerSet> listeners_;
+};
+
+}  // namespace Orvane
+}  // namespace android
+
+#endif  // ORVANE_PLATFORM_PIPELINE_H

@@ -1,0 +1,8 @@
+#if defined(__SANITIZE_THREAD__)
+// libutils is not built for ThreadSanitizer, so it cannot see that RefBase's reference count
+// orders every access before the delete: an object freed by the last decStrong on another
+// thread than its last user would be reported as a race.
+extern "C" const char* __tsan_default_suppressions() {
+    return "race:android::RefBase::decStrong\n";
+}
+#endif
