@@ -1,0 +1,129 @@
+#include "service/orvane_native_service.h"
+
+#include <cstring>
+
+#include <utils/String8.h>
+
+#if defined(__ANDROID__)
+#include <binder/IPCThreadState.h>
+#endif
+
+#include "plugins/cmd_processor.h"
+#include "utils/orvane_log.h"
+
+namespace android {
+namespace Orvane {
+namespace {
+
+constexpr uid_t kSystemUid = 1000;
+const char* const kCompanionProcess = "com.quor.orvaneservice";
+constexpr int32_t kServiceIsNullError = 1;
+
+std::string ToUtf8(const String16& str) { return String8(str).string(); }
+
+}  // namespace
+
+OrvaneNativeService::OrvaneNativeService(const sp<OrvaneService>& service, bool checkCaller)
+    : service_(service), checkCaller_(checkCaller) {}
+
+bool OrvaneNativeService::CanProcess() {
+    if (!checkCaller_) {
+        return true;
+    }
+    uid_t uid = IPCThreadState::self()->getCallingUid();
+    if (uid != kSystemUid) {
+        OLOGI("%s not suport calling_uid %d", static_cast<int>(uid));
+        return false;
+    }
+    pid_t pid = IPCThreadState::self()->getCallingPid();
+    // The command line's first argument is the process name.
+    if (strcmp(CmdProcessor::GetProcNameByPid(pid).c_str(), kCompanionProcess) != 0) {
+        OLOGI("%s not suport process %d", pid);
+        return false;
+    }
+    return true;
+}
+
+binder::Status OrvaneNativeService::ServiceIsNull(const char* method, int line) {
+    OLOG_AS(ANDROID_LOG_ERROR, method, "%s service is null");
+    return binder::Status::fromServiceSpecificError(kServiceIsNullError,
+                                                    String8::format("%s:%d: %s", method, line, "service is null"));
+}
+
+binder::Status OrvaneNativeService::notifyPackLog(int* result) {
+    if (!CanProcess()) {
+        return binder::Status::ok();
+    }
+    if (service_ == nullptr) {
+        return ServiceIsNull(__func__, __LINE__);
+    }
+    OLOGI("%s notify pack log start");
+    *result = service_->NotifyPackLog();
+    return binder::Status::ok();
+}
+
+binder::Status OrvaneNativeService::setRunMode(const String16& name, const String16& file) {
+    if (!CanProcess()) {
+        return binder::Status::ok();
+    }
+    if (service_ == nullptr) {
+        return ServiceIsNull(__func__, __LINE__);
+    }
+    std::string nameUtf8 = ToUtf8(name);
+    std::string fileUtf8 = ToUtf8(file);
+    OLOGI("%s set run mode name=%s, file=%s", nameUtf8.c_str(), fileUtf8.c_str());
+    service_->SetRunMode(nameUtf8, fileUtf8);
+    return binder::Status::ok();
+}
+
+binder::Status OrvaneNativeService::notifyUploadSwitch(bool on) {
+    if (!CanProcess()) {
+        return binder::Status::ok();
+    }
+    if (service_ == nullptr) {
+        return ServiceIsNull(__func__, __LINE__);
+    }
+    OLOGI("%s notify update switch start %d", on ? 1 : 0);
+    service_->NotifyUploadSwitch(on);
+    return binder::Status::ok();
+}
+
+binder::Status OrvaneNativeService::notifyConfigUpdate(const String16& folder) {
+    if (!CanProcess()) {
+        return binder::Status::ok();
+    }
+    if (service_ == nullptr) {
+        return ServiceIsNull(__func__, __LINE__);
+    }
+    std::string folderUtf8 = ToUtf8(folder);
+    OLOGI("%s notify config update start %s", folderUtf8.c_str());
+    service_->NotifyConfigUpdate(folderUtf8);
+    return binder::Status::ok();
+}
+
+binder::Status OrvaneNativeService::notifyUserActivated() {
+    if (!CanProcess()) {
+        return binder::Status::ok();
+    }
+    if (service_ == nullptr) {
+        return ServiceIsNull(__func__, __LINE__);
+    }
+    OLOGI("%s notify user activate");
+    service_->NotifyUserActivated();
+    return binder::Status::ok();
+}
+
+status_t OrvaneNativeService::dump(int fd, const Vector<String16>& args) {
+    if (service_ == nullptr) {
+        return OK;
+    }
+    std::vector<std::string> utf8Args;
+    for (size_t i = 0; i < args.size(); ++i) {
+        utf8Args.push_back(ToUtf8(args[i]));
+    }
+    service_->Dump(fd, utf8Args);
+    return OK;
+}
+
+}  // namespace Orvane
+}  // namespace android

@@ -1,0 +1,132 @@
+#include "service/orvane_service.h"
+
+#include <cstdio>
+#include <new>
+
+#include "service/binder_transport.h"
+#include "service/orvane_native_service.h"
+#include "utils/dev_info.h"
+#include "utils/orvane_log.h"
+#include "utils/time_util.h"
+
+namespace android {
+namespace Orvane {
+namespace {
+
+constexpr size_t kBinderThreads = 4;
+constexpr uint32_t kControlEventType = 1;
+constexpr uint32_t kPackLogEventId = 101;
+constexpr uint32_t kUploadSwitchEventId = 103;
+constexpr uint32_t kConfigUpdateEventId = 104;
+constexpr uint32_t kUserActivatedEventId = 105;
+const char* const kLogProcessor = "EventLogProcessor";
+const char* const kStorageManager = "EventStorageManager";
+
+}  // namespace
+
+OrvaneService::OrvaneService(PluginPlatform* platform) : platform_(platform) {}
+
+void OrvaneService::StartService() {
+    BinderTransport::StartThreadPool(kBinderThreads);
+    bool checkCaller = platform_->GetSysProperity("persist.sys.orvane.safecheck", "1") != "0";
+    sp<OrvaneNativeService> service = new OrvaneNativeService(this, checkCaller);
+    if (!BinderTransport::AddService("orvane", service, platform_->GetWorkDir())) {
+        return;
+    }
+    BinderTransport::JoinThreadPool();
+}
+
+sp<Event> OrvaneService::CreateEvent(const char* op, uint32_t eventId) {
+    sp<Event> event = new (std::nothrow) Event("OrvaneService");
+    if (event == nullptr) {
+        OLOG_AS(ANDROID_LOG_INFO, op, "%s event is null");
+        return nullptr;
+    }
+    event->eventId = eventId;
+    event->eventType = kControlEventType;
+    return event;
+}
+
+int OrvaneService::NotifyPackLog() {
+    sp<Event> event = CreateEvent(__func__, kPackLogEventId);
+    if (event == nullptr) {
+        return -1;
+    }
+    if (!platform_->PostSyncEventToTarget(kLogProcessor, event)) {
+        return 0;
+    }
+    return event->GetIntValue("EVENT_SERVICE_UPLOAD_RET");
+}
+
+void OrvaneService::SetRunMode(const std::string& name, const std::string& file) { DevInfo::SetRunMode(name, file); }
+
+void OrvaneService::NotifyUploadSwitch(bool on) {
+    sp<Event> event = CreateEvent(__func__, kUploadSwitchEventId);
+    if (event == nullptr) {
+        return;
+    }
+    event->SetValue("EVENT_UE_UPDATE", on ? 1 : 0);
+    platform_->PostAsyncEventToTarget(kLogProcessor, event);
+}
+
+void OrvaneService::NotifyConfigUpdate(const std::string& folder) {
+    platform_->SetCloudConfigFolder(folder);
+    sp<Event> event = CreateEvent(__func__, kConfigUpdateEventId);
+    if (event == nullptr) {
+        return;
+    }
+    platform_->PostUnorderedEvent(event);
+}
+
+void OrvaneService::NotifyUserActivated() {
+    sp<Event> event = CreateEvent(__func__, kUserActivatedEventId);
+    if (event == nullptr) {
+        return;
+    }
+    // Storage takes the activation time from the happen time.
+    event->happenTime = TimeUtil::GetTimestampSecond();
+    platform_->PostAsyncEventToTarget(kStorageManager, event);
+}
+
+void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
+    if (args.empty()) {
+        DumpPluginSummaryInfo(fd);
+    } else if (args.size() >= 2 && args[0] == "plugin") {
+        DumpPluginInfo(fd, args[1], std::vector<std::string>(args.begin() + 2, args.end()));
+    } else {
+        dprintf(fd, "usage: dump [plugin NAME [ARGS...]]\n");
+    }
+}
+
+void OrvaneService::DumpPluginSummaryInfo(int fd) {
+    std::map<std::string, sp<Plugin>> plugins = platform_->GetPlugins();
+    dprintf(fd, "Load plugin %u:\n", static_cast<unsigned>(plugins.size()));
+    for (const auto& entry : plugins) {
+        const sp<Plugin>& plugin = entry.second;
+        if (plugin == nullptr) {
+            dprintf(fd, "PluginName:%s not Loaded\n", entry.first.c_str());
+            continue;
+        }
+        sp<EventLoop> loop = plugin->GetLooper();
+        dprintf(fd, "PluginName:%s Version:%s Thread:%s\n", entry.first.c_str(), plugin->GetVersion().c_str(),
+                loop == nullptr ? "Null" : loop->GetName().c_str());
+    }
+    std::map<std::string, sp<Pipeline>> pipelines = platform_->GetPipelines();
+    dprintf(fd, "Load pipeline %u:\n", static_cast<unsigned>(pipelines.size()));
+    for (const auto& entry : pipelines) {
+        dprintf(fd, "pipelineName:%s\n", entry.first.c_str());
+    }
+}
+
+void OrvaneService::DumpPluginInfo(int fd, const std::string& name, const std::vector<std::string>& args) {
+    std::map<std::string, sp<Plugin>> plugins = platform_->GetPlugins();
+    auto it = plugins.find(name);
+    if (it == plugins.end() || it->second == nullptr) {
+        dprintf(fd, "plugin %s not exist", name.c_str());
+        return;
+    }
+    it->second->Dump(fd, args);
+}
+
+}  // namespace Orvane
+}  // namespace android

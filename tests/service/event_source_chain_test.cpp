@@ -1,0 +1,188 @@
+// The daemon as a process on emulated device nodes: kernel records end up in event.db, a
+// missing node stops only its own source, and a restart keeps what was stored.
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <sstream>
+#include <string>
+
+#include "tests/common/log_capture.h"
+#include "tests/plugins/devsim_process.h"
+
+namespace android {
+namespace Orvane {
+namespace {
+
+// event_info rows of an id: "first_time|occured_cnt|param_list" each, by row id.
+std::string StoredRows(const std::string& dbPath, uint32_t eventId) {
+    sqlite3* db = nullptr;
+    std::string rows;
+    if (sqlite3_open_v2(dbPath.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+        std::string sql = "select first_time, occured_cnt, param_list from event_info where event_id = " +
+                          std::to_string(eventId) + " order by id;";
+        sqlite3_exec(
+            db, sql.c_str(),
+            [](void* out, int columns, char** values, char**) {
+                std::string& text = *static_cast<std::string*>(out);
+                for (int i = 0; i < columns; ++i) {
+                    text += std::string(values[i] != nullptr ? values[i] : "NULL") + (i + 1 < columns ? "|" : "\n");
+                }
+                return 0;
+            },
+            &rows, nullptr);
+    }
+    sqlite3_close(db);
+    return rows;
+}
+
+std::string ReadFile(const std::string& path) {
+    std::ifstream in(path);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+size_t CountOf(const std::string& text, const std::string& part) {
+    size_t count = 0;
+    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1)) {
+        ++count;
+    }
+    return count;
+}
+
+class EventSourceChainTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        if (access((std::string(ORVANE_BINARY_DIR) + "/orvane").c_str(), X_OK) != 0) {
+            GTEST_SKIP() << "the daemon is not built in " << ORVANE_BINARY_DIR;
+        }
+        std::string failure;
+        if (!devsim.Start(&failure)) {
+            GTEST_SKIP() << "device emulator unavailable: " << failure;
+        }
+        char folderTemplate[] = "/tmp/orvane-chain-XXXXXX";
+        ASSERT_NE(nullptr, mkdtemp(folderTemplate));
+        folder = folderTemplate;
+        std::ofstream(folder + "/properties") << "ro.quor.build.region=CN\n";
+    }
+    void TearDown() override {
+        StopDaemon();
+        if (!folder.empty()) {
+            system(("rm -rf " + folder).c_str());
+        }
+    }
+
+    // Starts the daemon with the shipped configuration; true once it holds `nodes` open.
+    bool StartDaemon(const std::string& devList, const std::vector<std::string>& nodes) {
+        logPath = folder + "/orvane." + std::to_string(++starts) + ".log";
+        std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane";
+        std::string configDir = std::string(ORVANE_SOURCE_DIR) + "/etc";
+        std::string workDir = folder + "/work";
+        std::string cloudDir = folder + "/cloud";
+        std::string properties = folder + "/properties";
+        daemon = fork();
+        if (daemon == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
+            int log = open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+            dup2(log, STDOUT_FILENO);
+            dup2(log, STDERR_FILENO);
+            setenv("ORVANE_PROPERTY_FILE", properties.c_str(), 1);
+            execl(program.c_str(), program.c_str(), "-configDir", configDir.c_str(), "-workDir", workDir.c_str(),
+                  "-cloudCfgDir", cloudDir.c_str(), "-devList", devList.c_str(), static_cast<char*>(nullptr));
+            _exit(127);
+        }
+        return WaitUntil([&] {
+            std::string open = OpenFiles();
+            for (const std::string& node : nodes) {
+                if (open.find(node) == std::string::npos) {
+                    return false;
+                }
+            }
+            return true;
+        });
+    }
+
+    std::string OpenFiles() const {
+        std::string fdDir = "/proc/" + std::to_string(daemon) + "/fd";
+        std::string targets;
+        if (DIR* dir = opendir(fdDir.c_str())) {
+            while (dirent* entry = readdir(dir)) {
+                char target[512];
+                ssize_t length = readlink((fdDir + "/" + entry->d_name).c_str(), target, sizeof(target));
+                if (length > 0) {
+                    targets += std::string(target, length) + "\n";
+                }
+            }
+            closedir(dir);
+        }
+        return targets;
+    }
+
+    void StopDaemon() {
+        if (daemon > 0) {
+            kill(daemon, SIGTERM);
+            waitpid(daemon, nullptr, 0);
+            daemon = -1;
+        }
+    }
+
+    // The daemon's writes take no busy time-out, so progress is read from a copy.
+    bool WaitStored(uint32_t eventId, const std::string& expectedRows) {
+        std::string copy = folder + "/snapshot.db";
+        return WaitUntil([&] {
+            std::string cmd = "cp " + folder + "/work/event.db " + copy + " 2>/dev/null";
+            return system(cmd.c_str()) == 0 && StoredRows(copy, eventId) == expectedRows;
+        }, std::chrono::seconds(20));
+    }
+
+    std::string DbPath() const { return folder + "/work/event.db"; }
+
+    DevSim devsim;
+    std::string folder;
+    std::string logPath;
+    pid_t daemon = -1;
+    int starts = 0;
+};
+
+TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
+    std::string qxev = devsim.Path("qxev");
+    std::string missing = folder + "/no_such_node";
+    ASSERT_TRUE(StartDaemon("qxev=" + qxev + ",qx_exception_log=" + missing, {qxev}));
+
+    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000000 -paraList {\"device\": \"sda\", \"errno\": 5}"));
+    ASSERT_TRUE(devsim.Inject("qxev", "EventId 0 -t 1700000000 -paraList {}"));
+    ASSERT_TRUE(devsim.Inject("qxev", std::string("\x01\xff garbage", 10)));
+    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000100 -paraList {\"device\": \"sda\", \"errno\": 5}"));
+    const std::string firstDay = "1700000100|2|{\"device\": \"sda\", \"errno\": 5}\n";
+    ASSERT_TRUE(WaitStored(905001001, firstDay)) << StoredRows(folder + "/snapshot.db", 905001001);
+    StopDaemon();
+    EXPECT_EQ(firstDay, StoredRows(DbPath(), 905001001));
+
+    std::string log = ReadFile(logPath);
+    EXPECT_EQ(1u, CountOf(log, "openExceptionLogFd No kernel exception log monitor support (errno=2)")) << log;
+    EXPECT_EQ(2u, CountOf(log, "ParseEvent event invalid")) << log;
+
+    // A second start on the same work folder adds to what is stored.
+    std::string relay = devsim.Path("qx_exception_log");
+    ASSERT_TRUE(StartDaemon("qxev=" + qxev + ",qx_exception_log=" + relay, {qxev, relay}));
+    ASSERT_TRUE(devsim.Inject("qx_exception_log", "kernel BUG at mm/slub.c:420\n"));
+    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000200 -paraList {\"device\": \"sda\", \"errno\": 5}"));
+    const std::string secondStart = "1700000200|3|{\"device\": \"sda\", \"errno\": 5}\n";
+    ASSERT_TRUE(WaitStored(905001001, secondStart)) << StoredRows(folder + "/snapshot.db", 905001001);
+    StopDaemon();
+    EXPECT_EQ(secondStart, StoredRows(DbPath(), 905001001));
+    EXPECT_EQ(0u, CountOf(ReadFile(logPath), "No kernel exception log monitor support"));
+}
+
+}  // namespace
+}  // namespace Orvane
+}  // namespace android
