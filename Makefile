@@ -14,7 +14,7 @@ build: deps
 	cmake --build $(BUILD) -j $(JOBS)
 
 demo: build
-	bash scripts/demo.sh $(BUILD)
+	BUILD=$(BUILD) bash scripts/demo.sh
 
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)

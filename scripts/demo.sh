@@ -1,0 +1,238 @@
+#!/usr/bin/env bash
+# The daemon's main job on a host, end to end: kernel records written to emulated device
+# nodes become events that are counted, paced and stored in event.db under the shipped
+# quotas. Starts orvane-devsim and the daemon in a sandbox folder, writes a stream of records,
+# shows what was stored and what was dropped and why, then stops everything it started.
+# Assumes `make build` has run. BUILD names the build folder (default: build);
+# ORVANE_DEMO_KEEP=1 keeps the sandbox folder for a look afterwards.
+#
+# usage: demo.sh             the demonstration (well under two minutes)
+#        demo.sh load [S]    load figures instead: throughput for S seconds per run (default 60)
+set -euo pipefail
+
+MODE=${1:-demo}
+LOAD_SECONDS=${2:-60}
+case "$MODE" in
+    demo | load) ;;
+    *)
+        echo "usage: $0 [load [SECONDS]]" >&2
+        exit 2
+        ;;
+esac
+
+ROOT=$(cd "$(dirname "$0")/.." && pwd)
+BUILD_NAME=${BUILD:-build}
+BUILD=$(cd "$ROOT" && cd "$BUILD_NAME" 2> /dev/null && pwd) || {
+    echo "demo: build folder $BUILD_NAME not found; run 'make build' first" >&2
+    exit 1
+}
+for tool in orvane orvane-devsim; do
+    if [ ! -x "$BUILD/$tool" ]; then
+        echo "demo: $BUILD/$tool is missing; run 'make build' first" >&2
+        exit 1
+    fi
+done
+command -v sqlite3 > /dev/null || { echo "demo: sqlite3 is missing; run 'make deps'" >&2; exit 1; }
+
+SANDBOX=$(mktemp -d /tmp/orvane-demo-XXXXXX)
+DEV=$SANDBOX/dev
+WORK=$SANDBOX/work
+mkdir -p "$DEV" "$WORK" "$SANDBOX/cloud"
+export ORVANE_PROPERTY_FILE=$SANDBOX/properties
+cat > "$ORVANE_PROPERTY_FILE" <<'EOF'
+ro.quor.build.region=CN
+ro.quor.build.type=1
+ro.serialno=DEMO0001
+EOF
+
+DEVSIM_PID=
+DAEMON_PID=
+stop_processes() {
+    if [ -n "$DAEMON_PID" ]; then
+        kill "$DAEMON_PID" 2> /dev/null || true
+        wait "$DAEMON_PID" 2> /dev/null || true
+        DAEMON_PID=
+    fi
+    if [ -n "$DEVSIM_PID" ]; then
+        kill "$DEVSIM_PID" 2> /dev/null || true
+        wait "$DEVSIM_PID" 2> /dev/null || true
+        DEVSIM_PID=
+    fi
+    # A killed emulator can leave its mount behind.
+    if grep -qs " $DEV fuse" /proc/mounts; then
+        fusermount3 -u -z "$DEV" 2> /dev/null || umount -l "$DEV" 2> /dev/null || true
+    fi
+}
+stop_all() {
+    stop_processes
+    if [ "${ORVANE_DEMO_KEEP:-0}" = 1 ]; then
+        echo "sandbox kept: $SANDBOX"
+    else
+        rm -rf "$SANDBOX"
+    fi
+}
+trap stop_all EXIT
+
+# Waits up to $1 seconds for the command after it to succeed.
+wait_for() {
+    local bound=$(($1 * 10))
+    shift
+    for ((i = 0; i < bound; i++)); do
+        "$@" && return 0
+        sleep 0.1
+    done
+    return 1
+}
+
+section() { printf '\n== %s\n' "$*"; }
+
+section "sandbox $SANDBOX"
+"$BUILD/orvane-devsim" "$DEV" 2> "$SANDBOX/devsim.log" &
+DEVSIM_PID=$!
+if ! wait_for 10 test -e "$DEV/qxev"; then
+    echo "demo: the device emulator did not start:" >&2
+    cat "$SANDBOX/devsim.log" >&2
+    exit 1
+fi
+echo "device nodes emulated: $DEV/qxev $DEV/qx_exception_log"
+
+"$BUILD/orvane" -configDir "$ROOT/etc" -workDir "$WORK" -cloudCfgDir "$SANDBOX/cloud" \
+    -devList "qxev=$DEV/qxev,qx_exception_log=$DEV/qx_exception_log" > "$SANDBOX/orvane.log" 2>&1 &
+DAEMON_PID=$!
+LOG=$SANDBOX/orvane.log
+# The sources are running once the daemon holds both nodes open.
+sources_open() {
+    local fds
+    fds=$(ls -l "/proc/$DAEMON_PID/fd" 2> /dev/null) || return 1
+    [[ $fds == *"$DEV/qxev"* && $fds == *"$DEV/qx_exception_log"* ]]
+}
+if ! wait_for 20 sources_open; then
+    echo "demo: the daemon did not open the device nodes; the end of its log:" >&2
+    tail -n 30 "$LOG" >&2
+    exit 1
+fi
+echo "daemon running (pid $DAEMON_PID), log: $LOG"
+
+# The demonstration: a realistic stream of kernel records, then what became of them.
+run_demo() {
+    # The record stream. Happen times are the kernel's stamps in seconds; they are placed within
+    # today so that the day's counters apply.
+    MIDNIGHT=$(date -d 'today 00:00' +%s)
+    QXEV=$DEV/qxev
+    FAULTS=0
+    record() { # id time params: one write is one record, as a driver hands it over
+        printf 'EventId %s -t %s -paraList %s' "$1" "$2" "$3" > "$QXEV"
+    }
+    fault() { # a record whose id lies in the fault ranges, which storage counts
+        record "$@"
+        FAULTS=$((FAULTS + 1))
+    }
+
+    section "writing kernel records"
+    # Faults of three domains (kernel 901, framework 902, storage 905), well spaced, within quota.
+    fault 901001001 $((MIDNIGHT + 3600)) '{"reason":"wlan firmware crash","uptime":5120}'
+    fault 901001002 $((MIDNIGHT + 3700)) '{"task":"kworker/2:1","blockedSec":120}'
+    fault 902001001 $((MIDNIGHT + 3800)) '{"pkg":"com.android.phone","versionCode":33,"exception":"NullPointerException"}'
+    fault 905001001 $((MIDNIGHT + 3900)) '{"device":"sda","errno":5,"sector":123456}'
+    fault 905001001 $((MIDNIGHT + 9000)) '{"device":"sda","errno":5,"sector":123456}'
+    echo "5 faults of the kernel, framework and storage domains"
+
+    # The same wlan crash again and again, two hours apart: each opens a new hour period, so only
+    # its daily quota (3 in event_quota.xml) stops it.
+    for hour in 3 5 7 9 11 13 15 17; do
+        fault 901001001 $((MIDNIGHT + hour * 3600)) '{"reason":"wlan firmware crash","uptime":5120}'
+    done
+    echo "8 more wlan crashes, two hours apart (daily quota 3)"
+
+    # An ANR storm: 30 reports within two seconds. The first ones of the hour pass; the rest come
+    # too close together under the pacing rule.
+    for i in $(seq 1 30); do
+        fault 902001002 $((MIDNIGHT + 20000 + i / 15)) '{"pkg":"com.example.maps","anrReason":"input dispatching timed out"}'
+    done
+    echo "30 ANRs of one app within two seconds (pacing)"
+
+    # Malformed and foreign records: each is dropped by the source or ignored by storage.
+    printf 'EventId 0 -t %s -paraList {}' "$MIDNIGHT" > "$QXEV"
+    printf 'EventId -5 -t %s -paraList {}' "$MIDNIGHT" > "$QXEV"
+    printf 'no keywords at all' > "$QXEV"
+    printf 'EventId 901001001 -t' > "$QXEV"
+    printf '\x01\x02\xff\xfe binary garbage' > "$QXEV"
+    MALFORMED=5
+    record 123 $((MIDNIGHT + 100)) '{"not":"a fault id"}'
+    echo "$MALFORMED malformed records and 1 record with an id outside the fault ranges"
+
+    # The exception log channel: forwarded as event 902902 with the record unparsed.
+    printf 'kernel BUG at mm/slub.c:420 pid=1234\n' > "$DEV/qx_exception_log"
+    echo "1 exception log record (event 902902: outside the fault ranges, so not stored)"
+
+    section "waiting for the daemon to handle them"
+    DB=$WORK/event.db
+    # The daemon's writes take no busy time-out, so nothing reads its database while it runs:
+    # progress is read from copies, the results after it has stopped.
+    SNAPSHOT=$SANDBOX/snapshot.db
+    drops() { grep -c "over daily cnt drop it\|over hour cnt drop it" "$LOG" || true; }
+    stored() { # kept fault occurrences of the domains written above
+        cp "$DB" "$SNAPSHOT" 2> /dev/null &&
+            sqlite3 "$SNAPSHOT" "select coalesce(sum(occured_cnt), 0) from event_info
+                                 where event_id between 901000000 and 905999999;" 2> /dev/null || echo 0
+    }
+    # Every fault record ends stored (counted in occured_cnt) or dropped with a logged reason.
+    settled() { [ $(($(stored) + $(drops))) -ge "$FAULTS" ]; }
+    if wait_for 30 settled; then
+        echo "all $FAULTS fault records were stored or dropped"
+    else
+        echo "after 30 s only $(($(stored) + $(drops))) of $FAULTS fault records were stored or dropped"
+    fi
+
+    if [ -x "$BUILD/orvanectl" ] && [ -S "$WORK/orvane.sock" ]; then
+        section "orvanectl dump plugin EventStorageManager query event_daily"
+        "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventStorageManager query event_daily || true
+    fi
+
+    section "stopping the daemon and the emulator"
+    stop_processes
+    echo "stopped"
+
+    section "stored events per id (event_info)"
+    sqlite3 -header -column "$DB" \
+        "select event_id, count(*) as rows, sum(occured_cnt) as occurrences from event_info group by event_id order by event_id;"
+    echo "(908001001 is the daemon's own report of an event that went over its daily quota)"
+
+    section "today's counters (event_daily)"
+    sqlite3 -header -column "$DB" \
+        "select event_id, daily_cnt, over_cnt, hour_cnt from event_daily order by event_id;"
+
+    section "drops and their reasons (from the daemon's log)"
+    {
+        grep -o "event [0-9]* over daily cnt" "$LOG" | awk '{print $2, "over daily quota"}'
+        grep -o "event [0-9]* over hour cnt" "$LOG" | awk '{print $2, "event happen too sequence, drop it by punish"}'
+    } | sort | uniq -c | awk '{c=$1; $1=""; printf "%6d x%s\n", c, $0}'
+    echo "$(grep -c "ParseEvent event invalid" "$LOG") records rejected by the source as invalid"
+}
+
+# Load figures: end-to-end throughput with few and with many distinct ids, then the latency
+# from the write on the node to the commit at a steady 100 events a second.
+run_load() {
+    local seconds=$1
+    [ -x "$BUILD/orvane-loadgen" ] || { echo "demo: $BUILD/orvane-loadgen is missing" >&2; exit 1; }
+    local results=$SANDBOX/load.txt
+    section "throughput, 50 distinct ids (most dropped by quota), ${seconds} s"
+    "$BUILD/orvane-loadgen" throughput "$DEV/qxev" "$WORK" "$DAEMON_PID" 50 "$seconds" | tee -a "$results"
+    section "throughput, 5000 distinct ids (mostly stored), ${seconds} s"
+    "$BUILD/orvane-loadgen" throughput "$DEV/qxev" "$WORK" "$DAEMON_PID" 5000 "$seconds" | tee -a "$results"
+    section "latency from write to commit at 100 events/s, 20 s"
+    "$BUILD/orvane-loadgen" latency "$DEV/qxev" "$WORK" 100 20 | tee -a "$results"
+    section "stopping the daemon and the emulator"
+    stop_processes
+    section "nothing lost: $(grep -o 'written=[0-9]*' "$results" | awk -F= '{n += $2} END {print n}') records written"
+    sqlite3 -header -column "$WORK/event.db" \
+        "select (select coalesce(sum(occured_cnt), 0) from event_info where event_id between 903000000 and 904999999)
+                as stored,
+                (select coalesce(sum(over_cnt), 0) from event_daily where event_id between 903000000 and 904999999)
+                as dropped;"
+}
+
+case "$MODE" in
+    demo) run_demo ;;
+    load) run_load "$LOAD_SECONDS" ;;
+esac

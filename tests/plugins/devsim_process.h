@@ -1,0 +1,98 @@
+#ifndef ORVANE_TESTS_PLUGINS_DEVSIM_PROCESS_H
+#define ORVANE_TESTS_PLUGINS_DEVSIM_PROCESS_H
+
+#include <fcntl.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/prctl.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "tests/common/log_capture.h"
+
+namespace android {
+namespace Orvane {
+
+// orvane-devsim serving a fresh folder, for as long as the object lives.
+class DevSim {
+public:
+    // False with the emulator's own one-line reason when FUSE cannot be mounted here.
+    bool Start(std::string* failure) {
+        char folderTemplate[] = "/tmp/orvane-devsim-test-XXXXXX";
+        if (mkdtemp(folderTemplate) == nullptr) {
+            *failure = "cannot create a mount folder";
+            return false;
+        }
+        folder = folderTemplate;
+        int errPipe[2];
+        if (pipe2(errPipe, O_CLOEXEC) != 0) {
+            *failure = "cannot create a pipe";
+            return false;
+        }
+        std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane-devsim";
+        pid = fork();
+        if (pid == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGTERM);  // a crashed test leaves no mount behind
+            dup2(errPipe[1], STDERR_FILENO);
+            execl(program.c_str(), program.c_str(), folder.c_str(), static_cast<char*>(nullptr));
+            _exit(127);
+        }
+        close(errPipe[1]);
+        std::string node = Path("qxev");
+        bool mounted = WaitUntil([&] {
+            struct stat st;
+            return stat(node.c_str(), &st) == 0 || waitpid(pid, nullptr, WNOHANG) == pid;
+        });
+        struct stat st;
+        if (!mounted || stat(node.c_str(), &st) != 0) {
+            char reason[512] = {};
+            fcntl(errPipe[0], F_SETFL, O_NONBLOCK);
+            ssize_t length = read(errPipe[0], reason, sizeof(reason) - 1);
+            *failure = length > 0 ? std::string(reason, length) : "orvane-devsim did not start: " + program;
+            close(errPipe[0]);
+            Stop();
+            return false;
+        }
+        close(errPipe[0]);
+        return true;
+    }
+    ~DevSim() { Stop(); }
+
+    std::string Path(const std::string& node) const { return folder + "/" + node; }
+
+    // One write, one record, as a driver queues it.
+    bool Inject(const std::string& node, const std::string& record) const {
+        int fd = open(Path(node).c_str(), O_WRONLY | O_CLOEXEC);
+        if (fd < 0) {
+            return false;
+        }
+        bool written = write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
+        close(fd);
+        return written;
+    }
+
+    // Unmounts; readers still blocked on a node then see their read fail.
+    void Stop() {
+        if (pid > 0) {
+            kill(pid, SIGTERM);
+            waitpid(pid, nullptr, 0);
+            pid = -1;
+        }
+        if (!folder.empty()) {
+            rmdir(folder.c_str());
+            folder.clear();
+        }
+    }
+
+private:
+    std::string folder;
+    pid_t pid = -1;
+};
+
+}  // namespace Orvane
+}  // namespace android
+
+#endif  // ORVANE_TESTS_PLUGINS_DEVSIM_PROCESS_H
