@@ -1,0 +1,170 @@
+#include "storage/event_storage_manager.h"
+
+#include <stdio.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <future>
+#include <memory>
+
+#include "platform/plugin_context.h"
+#include "platform/plugin_factory.h"
+#include "utils/dev_info.h"
+#include "utils/file_util.h"
+#include "utils/orvane_log.h"
+#include "utils/string_util.h"
+
+namespace android {
+namespace Orvane {
+
+ORVANE_REGISTER_PLUGIN(EventStorageManager);
+
+namespace {
+constexpr char DB_FILE_NAME[] = "event.db";
+constexpr char PROP_CHECK_SIZE[] = "orvane.store.checksize";
+constexpr char PROP_CHECK_TIME[] = "orvane.store.checktime";
+constexpr char PROP_SAFE_CHECK[] = "persist.sys.orvane.safecheck";
+constexpr uint32_t DEFAULT_CHECK_SIZE = 209715200;
+constexpr uint32_t DEFAULT_CHECK_TIME = 86400;
+
+constexpr uint32_t CATEGORY_CONTROL = 1;
+constexpr uint32_t CATEGORY_RAW = 4;
+constexpr uint32_t USER_ACTIVATE_EVENT_ID = 105;
+constexpr uint32_t RAW_ID_MIN = 100000;
+constexpr uint32_t RAW_ID_MAX = 199999;
+// Handed back for ids that are not stored; as a handler result it ends the pipeline.
+constexpr EVENT_RET NOT_STORED = static_cast<EVENT_RET>(0xFFFFFFFFu);
+// How long a dump waits for the storage loop before giving up.
+constexpr auto DUMP_WAIT = std::chrono::seconds(10);
+
+bool IsFaultId(uint32_t id) {
+    return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
+}
+}  // namespace
+
+EventStorageManager::EventStorageManager() : helper_(new EventDatabaseHelper()) {}
+
+void EventStorageManager::OnLoad() {
+    SetVersion("EventStorageManager-1.0");
+    SetName("EventStorageManager");
+    helper_->Init(GetPluginContext(), DB_FILE_NAME, DevInfo::GetQuorVersion());
+    sp<EventLoop> loop = GetLooper();
+    if (loop == nullptr) {
+        OLOGE("%s storage manager looper not set");
+        return;
+    }
+    ScheduleCheck(loop, 0);
+}
+
+void EventStorageManager::ScheduleCheck(const sp<EventLoop>& loop, uint32_t delaySeconds) {
+    // Weak, so that the queued check does not keep the plugin (and with it its loop) alive.
+    wp<EventStorageManager> weak = this;
+    loop->AddTask(
+        [weak]() {
+            sp<EventStorageManager> self = weak.promote();
+            if (self != nullptr) {
+                self->CheckEventStore();
+            }
+        },
+        delaySeconds, false);
+}
+
+uint32_t EventStorageManager::GetStoreProperity(const std::string& name, uint32_t defaultValue) {
+    PluginContext* context = GetPluginContext();
+    std::string text = context != nullptr ? context->GetSysProperity(name, "") : "";
+    uint32_t value = text.empty() ? 0 : StringUtil::ConvertUInt(text);
+    if (value != 0) {
+        return value;
+    }
+    OLOGD("%s prop %s use default value", name.c_str());
+    return defaultValue;
+}
+
+void EventStorageManager::CheckEventStore() {
+    uint32_t checkSize = GetStoreProperity(PROP_CHECK_SIZE, DEFAULT_CHECK_SIZE);
+    int64_t fileSize = FileUtil::GetFileSize(helper_->GetDbPath());
+    if (fileSize >= 0 && static_cast<uint32_t>(fileSize) >= checkSize) {
+        helper_->AbridgeDbSize(checkSize);
+    }
+    uint32_t checkTime = GetStoreProperity(PROP_CHECK_TIME, DEFAULT_CHECK_TIME);
+    sp<EventLoop> loop = GetLooper();
+    if (loop != nullptr) {
+        ScheduleCheck(loop, checkTime);
+    }
+}
+
+EVENT_RET EventStorageManager::OnEvent(sp<Event>& event) {
+    if (event == nullptr) {
+        return 0;
+    }
+    OLOGD("%s EventStorageManager event=%u,%d", event->eventId, static_cast<int>(event->eventType));
+    switch (event->eventType) {
+        case CATEGORY_RAW:
+            if (event->eventId >= RAW_ID_MIN && event->eventId <= RAW_ID_MAX) {
+                helper_->SaveRawEvent(event);
+            }
+            return 0;
+        case CATEGORY_CONTROL:
+            if (event->eventId == USER_ACTIVATE_EVENT_ID) {
+                helper_->SaveUserActivateTime(event);
+            }
+            return 0;
+        default:
+            if (!IsFaultId(event->eventId)) {
+                return NOT_STORED;
+            }
+            helper_->ProcessFaultEvent(event);
+            return 0;
+    }
+}
+
+void EventStorageManager::Dump(int fd, const std::vector<std::string>& args) {
+    if (args.empty()) {
+        return;
+    }
+    sp<EventLoop> loop = GetLooper();
+    if (loop == nullptr) {
+        RunDump(fd, args);
+        return;
+    }
+    // The task owns a copy of the descriptor, so a dump that outlives the wait writes nowhere harmful.
+    int taskFd = dup(fd);
+    if (taskFd < 0) {
+        dprintf(fd, "dump failed\n");
+        return;
+    }
+    auto done = std::make_shared<std::promise<void>>();
+    std::future<void> finished = done->get_future();
+    sp<EventStorageManager> self = this;
+    loop->AddTask([self, taskFd, args, done]() {
+        self->RunDump(taskFd, args);
+        close(taskFd);
+        done->set_value();
+    });
+    if (finished.wait_for(DUMP_WAIT) != std::future_status::ready) {
+        OLOGW("%s storage loop busy, dump %s not done in time", args[0].c_str());
+        dprintf(fd, "storage busy, try again\n");
+    }
+}
+
+void EventStorageManager::RunDump(int fd, const std::vector<std::string>& args) {
+    const std::string& command = args[0];
+    if (command == "query") {
+        helper_->DumpQueryDb(fd, args);
+    } else if (command == "update") {
+        PluginContext* context = GetPluginContext();
+        if (context != nullptr && context->GetSysProperity(PROP_SAFE_CHECK, "") == "0") {
+            helper_->DumpUpdateDb(fd, args);
+        } else {
+            dprintf(fd, "not support cmd\n");
+        }
+    } else if (command == "quota" && args.size() >= 2) {
+        helper_->DumpQuota(fd, args[1]);
+    } else {
+        dprintf(fd, "usage: query <table> [limit] | update <table> <column> <value> <whereColumn> <whereValue> | "
+                    "quota <eventId>\n");
+    }
+}
+
+}  // namespace Orvane
+}  // namespace android

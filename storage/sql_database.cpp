@@ -1,0 +1,244 @@
+#include "storage/sql_database.h"
+
+#include <sqlite3.h>
+
+#include "utils/file_util.h"
+#include "utils/orvane_log.h"
+#include "utils/string_util.h"
+
+namespace android {
+namespace Orvane {
+
+namespace {
+constexpr int64_t SOFT_HEAP_LIMIT = 102400;
+constexpr mode_t DB_FILE_MODE = 0640;
+
+const char* TypeWord(SqlFieldType type) {
+    switch (type) {
+        case SqlFieldType::INTEGER:
+            return "INTEGER";
+        case SqlFieldType::TEXT:
+            return "TEXT";
+        case SqlFieldType::REAL:
+            return "REAL";
+    }
+    return "";
+}
+}  // namespace
+
+SqlField::SqlField(const std::string& name, SqlFieldType type) : SqlField(name, type, false, false, true) {}
+
+SqlField::SqlField(const std::string& name, SqlFieldType type, bool nullable)
+    : SqlField(name, type, false, false, nullable) {}
+
+SqlField::SqlField(const std::string& name, SqlFieldType type, bool primaryKey, bool autoIncrement, bool nullable)
+    : name_(name),
+      type_(type),
+      primaryKey_(primaryKey),
+      autoIncrement_(autoIncrement),
+      nullable_(nullable),
+      hasDefault_(false) {}
+
+std::string SqlField::GetFieldStatement() const {
+    std::string clause = name_ + " " + TypeWord(type_);
+    if (!nullable_) {
+        clause += " NOT NULL";
+    }
+    if (primaryKey_) {
+        clause += " PRIMARY KEY";
+    }
+    if (autoIncrement_) {
+        clause += " AUTOINCREMENT";
+    }
+    if (hasDefault_) {
+        clause += " default '" + defaultValue_ + "'";
+    }
+    return clause;
+}
+
+std::vector<std::string> BaseTable::GetFieldNameList() const {
+    std::vector<std::string> names;
+    names.reserve(fields_.size());
+    for (const auto& field : fields_) {
+        names.push_back(field->GetName());
+    }
+    return names;
+}
+
+sp<SqlField> BaseTable::GetField(const std::string& name) const {
+    for (const auto& field : fields_) {
+        if (field->GetName() == name) {
+            return field;
+        }
+    }
+    return nullptr;
+}
+
+std::string BaseTable::GenerateCreateTableStatement() const {
+    if (fields_.empty()) {
+        return "";
+    }
+    std::string sql = "create table IF NOT EXISTS " + tableName_ + "(";
+    for (size_t i = 0; i < fields_.size(); i++) {
+        if (i > 0) {
+            sql += ",";
+        }
+        sql += fields_[i]->GetFieldStatement();
+    }
+    return sql + ")";
+}
+
+std::string BaseTable::SqlValue(const sp<SqlField>& field, std::string value) {
+    if (field->GetType() != SqlFieldType::TEXT) {
+        return value;
+    }
+    return "'" + StringUtil::EscapeSqliteChar(value) + "'";
+}
+
+std::string BaseTable::BuildInsertStatement(std::vector<std::string> names, std::vector<std::string> values) const {
+    std::string nameList;
+    std::string valueList;
+    for (size_t i = 0; i < names.size() && i < values.size(); i++) {
+        sp<SqlField> field = GetField(names[i]);
+        if (field == nullptr) {
+            continue;
+        }
+        valueList += SqlValue(field, std::move(values[i])) + ",";
+        nameList += names[i] + ",";
+    }
+    nameList = StringUtil::TrimStr(nameList, ',');
+    valueList = StringUtil::TrimStr(valueList, ',');
+    if (nameList.empty()) {
+        return "";
+    }
+    return "insert into " + tableName_ + " (" + nameList + ") " + " values ( " + valueList + ") ";
+}
+
+std::string BaseTable::BuildUpdateStatement(std::vector<std::string> names, std::vector<std::string> values) const {
+    std::string pairs;
+    for (size_t i = 0; i < names.size() && i < values.size(); i++) {
+        sp<SqlField> field = GetField(names[i]);
+        if (field == nullptr) {
+            continue;
+        }
+        if (!pairs.empty()) {
+            pairs += ", ";
+        }
+        pairs += names[i] + "=" + SqlValue(field, std::move(values[i]));
+    }
+    if (pairs.empty()) {
+        return "";
+    }
+    return "update " + tableName_ + " set " + pairs;
+}
+
+bool SqlDatabase::Open() {
+    if (path_.empty()) {
+        return false;
+    }
+    Close();
+    // Both fail harmlessly once SQLite is initialised; they matter for the first open only.
+    sqlite3_config(SQLITE_CONFIG_SMALL_MALLOC, 1);
+    sqlite3_soft_heap_limit64(SOFT_HEAP_LIMIT);
+    if (sqlite3_open(path_.c_str(), &handle_) != SQLITE_OK) {
+        lastError_ = sqlite3_errmsg(handle_);
+        OLOGE("%s failed open db %s, %s", path_.c_str(), lastError_.c_str());
+        // A failed open still allocates a handle that must be released.
+        sqlite3_close(handle_);
+        handle_ = nullptr;
+        return false;
+    }
+    if (!Execute("PRAGMA cache_size=10;", false)) {
+        OLOGE("%s failed db %s set cache size, %s", path_.c_str(), lastError_.c_str());
+    }
+    if (!Execute("PRAGMA synchronous=1;", false)) {
+        OLOGE("%s failed db %s set synchronous, %s", path_.c_str(), lastError_.c_str());
+    }
+    FileUtil::ChangeMode(path_, DB_FILE_MODE);
+    return true;
+}
+
+void SqlDatabase::Close() {
+    if (handle_ == nullptr) {
+        return;
+    }
+    sqlite3_close(handle_);
+    lastError_.clear();
+    results_.clear();
+    handle_ = nullptr;
+}
+
+bool SqlDatabase::Execute(const std::string& sql, bool wantRows) {
+    lastError_.clear();
+    results_.clear();
+    if (handle_ == nullptr) {
+        return false;
+    }
+    OLOGD("%s start execute sql %s:%s", path_.c_str(), sql.c_str());
+    char* error = nullptr;
+    int ret = sqlite3_exec(handle_, sql.c_str(), wantRows ? &SqlDatabase::GetExecResult : nullptr,
+                           wantRows ? this : nullptr, &error);
+    if (ret == SQLITE_OK) {
+        return true;
+    }
+    if (error != nullptr) {
+        lastError_ = error;
+        sqlite3_free(error);
+    }
+    return false;
+}
+
+bool SqlDatabase::ExecuteSql(const std::string& sql) {
+    bool ok = Execute(sql, false);
+    if (!ok) {
+        OLOGW("%s failed execute sql %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
+    }
+    return ok;
+}
+
+int SqlDatabase::GetExecResult(void* context, int columnCount, char** values, char** columnNames) {
+    if (context == nullptr || values == nullptr || columnNames == nullptr) {
+        return 0;
+    }
+    auto* db = static_cast<SqlDatabase*>(context);
+    const std::vector<std::string>& names = db->expectedFieldNames_;
+    if (columnCount < 0 || static_cast<size_t>(columnCount) != names.size()) {
+        OLOGE("%s failed result cnt=%d,expCnt=%d,", columnCount, static_cast<int>(names.size()));
+        return 0;
+    }
+    SqlRow row;
+    for (int i = 0; i < columnCount; i++) {
+        row[names[i]] = values[i] != nullptr ? values[i] : "";
+    }
+    if (!row.empty()) {
+        db->results_.push_back(std::move(row));
+    }
+    return 0;
+}
+
+std::vector<SqlRow> SqlDatabase::QueryRecord(const std::string& sql, const std::vector<std::string>& fieldNames) {
+    if (handle_ == nullptr) {
+        return results_;
+    }
+    expectedFieldNames_ = fieldNames;
+    if (!Execute(sql, true)) {
+        OLOGE("%s failed QueryRecord %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
+    }
+    expectedFieldNames_.clear();
+    return results_;
+}
+
+bool SqlDatabase::TruncateTable(const std::string& table) {
+    if (handle_ == nullptr) {
+        return false;
+    }
+    if (!Execute("delete from " + table, false)) {
+        OLOGW("%s failed truncate table %s:%s, %s", path_.c_str(), table.c_str(), lastError_.c_str());
+        return false;
+    }
+    Execute("DELETE FROM sqlite_sequence WHERE name='" + table + "'", false);
+    return true;
+}
+
+}  // namespace Orvane
+}  // namespace android

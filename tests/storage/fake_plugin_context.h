@@ -1,0 +1,74 @@
+#ifndef ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
+#define ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/event_loop.h"
+#include "platform/plugin_context.h"
+
+namespace android {
+namespace Orvane {
+
+// A platform stand-in for the storage tests: fixed folders, properties in a map, a real shared
+// work loop, and a record of the events inserted into pipelines. Any thread may call it.
+class FakePluginContext : public PluginContext {
+public:
+    FakePluginContext(const std::string& workDir, const std::string& configDir)
+        : workDir_(workDir), configDir_(configDir), sharedLoop_(new EventLoop("plat_shared")) {
+        sharedLoop_->StartLoop();
+    }
+    ~FakePluginContext() override { sharedLoop_->StopLoop(); }
+
+    void SetProperty(const std::string& key, const std::string& value) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        properties_[key] = value;
+    }
+    std::vector<std::pair<std::string, sp<Event>>> Inserted() {
+        std::lock_guard<std::mutex> lock(mutex_);
+        return inserted_;
+    }
+
+    bool IsReady() override { return true; }
+    std::string GetWorkDir() override { return workDir_; }
+    std::string GetConfigDir() override { return configDir_; }
+    std::string GetCloudConfigDir() override { return configDir_; }
+    sp<EventLoop> GetSharedWorkLoop() override { return sharedLoop_; }
+    sp<EventLoop> GetLooperByName(const std::string&) override { return sharedLoop_; }
+    std::string GetSysProperity(const std::string& key, const std::string& defaultValue) override {
+        std::lock_guard<std::mutex> lock(mutex_);
+        auto it = properties_.find(key);
+        return it == properties_.end() ? defaultValue : it->second;
+    }
+    bool SetSysProperity(const std::string& key, const std::string& value) override {
+        SetProperty(key, value);
+        return true;
+    }
+    std::string GetDevicePath(const std::string&, const std::string& defaultPath) override { return defaultPath; }
+    bool PostUnorderedEvent(sp<Event>) override { return true; }
+    void RegisterUnorderedEventListener(sp<EventListener>) override {}
+    bool PostSyncEventToTarget(const std::string&, sp<Event>) override { return false; }
+    bool PostAsyncEventToTarget(const std::string&, sp<Event>) override { return false; }
+    bool InsertEventToPipeline(const std::string& pipelineName, sp<Event> event) override {
+        std::lock_guard<std::mutex> lock(mutex_);
+        inserted_.emplace_back(pipelineName, event);
+        return true;
+    }
+    bool RegisterPipelineListener(const std::string&, sp<Plugin>) override { return false; }
+    void SetCloudConfigFolder(const std::string&) override {}
+
+private:
+    std::string workDir_;
+    std::string configDir_;
+    sp<EventLoop> sharedLoop_;
+    std::mutex mutex_;
+    std::map<std::string, std::string> properties_;
+    std::vector<std::pair<std::string, sp<Event>>> inserted_;
+};
+
+}  // namespace Orvane
+}  // namespace android
+
+#endif  // ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
