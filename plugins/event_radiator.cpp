@@ -86,7 +86,7 @@ void EventRadiator::ParseEvent(char* record) {
     // parameter text survive. The search starts at the record's beginning: a token that also
     // appears earlier (say "5" in a record of id 5) makes the value start there.
     std::string text(record);
-    event->SetValue("param_list", text.substr(text.find(firstToken)));
+    event->SetValue(KEY_PARAM_LIST, text.substr(text.find(firstToken)));
     PublishPipelineEvent(event);
 }
 

@@ -55,7 +55,7 @@ int OrvaneService::NotifyPackLog() {
     if (!platform_->PostSyncEventToTarget(kLogProcessor, event)) {
         return 0;
     }
-    return event->GetIntValue("EVENT_SERVICE_UPLOAD_RET");
+    return event->GetIntValue(KEY_SERVICE_UPLOAD_RET);
 }
 
 void OrvaneService::SetRunMode(const std::string& name, const std::string& file) { DevInfo::SetRunMode(name, file); }
@@ -65,7 +65,7 @@ void OrvaneService::NotifyUploadSwitch(bool on) {
     if (event == nullptr) {
         return;
     }
-    event->SetValue("EVENT_UE_UPDATE", on ? 1 : 0);
+    event->SetValue(KEY_UE_UPDATE, on ? 1 : 0);
     platform_->PostAsyncEventToTarget(kLogProcessor, event);
 }
 

@@ -26,15 +26,6 @@ constexpr uint32_t FAULT_EVENT_TYPE = 2;
 constexpr char FAULT_PIPELINE[] = "dftFaultEvent";
 constexpr char SENDER[] = "EventStorageManager";
 
-constexpr char KEY_PARAM_LIST[] = "param_list";
-constexpr char KEY_EXPIRE[] = "expire";
-constexpr char KEY_VISIBLE[] = "visible";
-constexpr char KEY_DROP_REASON[] = "dropReason";
-constexpr char KEY_NO_CATCH_LOG[] = "noCatchLog";
-constexpr char KEY_RAW_EVENT_DB_ID[] = "rawEventDbID";
-constexpr char NO_LOG_CONFIG[] = "NO_LOG_CONFIG";
-constexpr char WAIT_LOG_CATCH[] = "WAIT_LOG_CATCH";
-
 constexpr char USAGE_QUERY[] = "usage: query <table> [limit]\n";
 constexpr char USAGE_UPDATE[] = "usage: update <table> <column> <value> <whereColumn> <whereValue>\n";
 
