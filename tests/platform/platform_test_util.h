@@ -1,21 +1,17 @@
-// Helpers of the platform tests that run plugins on loops. Include from one file per program:
-// it defines the ThreadSanitizer suppressions of that program.
-#ifndef ORVANE_TESTS_PLATFORM_PLATFORM_TEST_UTIL_H
-#define ORVANE_TESTS_PLATFORM_PLATFORM_TEST_UTIL_H
+// Helpers of the platform tests that run plugins on loops.
+#pragma once
 
-#include <chrono>
-#include <condition_variable>
+#include <gtest/gtest.h>
+
+#include <algorithm>
 #include <future>
 #include <mutex>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "platform/event_loop.h"
 #include "tests/common/log_capture.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 
 // What ran, in order, on which thread and when. Safe from any thread.
 class Journal {
@@ -45,29 +41,14 @@ public:
         }
         return entries;
     }
-    size_t Count(const std::string& what) {
-        size_t count = 0;
-        for (const auto& record : Records()) {
-            count += record.what == what;
-        }
-        return count;
-    }
-    // The first record of `what`; false when there is none.
-    bool Find(const std::string& what, Record& out) {
-        for (const auto& record : Records()) {
-            if (record.what == what) {
-                out = record;
-                return true;
-            }
-        }
-        return false;
-    }
-    std::thread::id ThreadOf(const std::string& what) {
-        Record record;
-        return Find(what, record) ? record.thread : std::thread::id();
+    // The first record of `what`; one with an empty `what` when there is none.
+    Record Find(const std::string& what) {
+        auto records = Records();
+        auto it = std::find_if(records.begin(), records.end(), [&](const Record& r) { return r.what == what; });
+        return it == records.end() ? Record() : *it;
     }
     bool WaitFor(const std::string& what) {
-        return WaitUntil([&] { return Count(what) > 0; });
+        return WaitUntil([&] { return !Find(what).what.empty(); });
     }
     bool WaitForSize(size_t size) {
         return WaitUntil([&] { return Records().size() >= size; });
@@ -81,20 +62,12 @@ private:
 // Holds whoever waits at it until the test opens it.
 class Gate {
 public:
-    void Open() {
-        std::lock_guard<std::mutex> lock(mutex_);
-        open_ = true;
-        cv_.notify_all();
-    }
-    void Wait() {
-        std::unique_lock<std::mutex> lock(mutex_);
-        cv_.wait(lock, [this] { return open_; });
-    }
+    void Open() { opened_.set_value(); }
+    void Wait() { waiting_.wait(); }
 
 private:
-    std::mutex mutex_;
-    std::condition_variable cv_;
-    bool open_ = false;
+    std::promise<void> opened_;
+    std::shared_future<void> waiting_ = opened_.get_future().share();
 };
 
 inline std::thread::id ThreadOfLoop(const sp<EventLoop>& loop) {
@@ -103,7 +76,4 @@ inline std::thread::id ThreadOfLoop(const sp<EventLoop>& loop) {
     return id.get_future().get();
 }
 
-}  // namespace Orvane
-}  // namespace android
-
-#endif  // ORVANE_TESTS_PLATFORM_PLATFORM_TEST_UTIL_H
+}  // namespace android::Orvane

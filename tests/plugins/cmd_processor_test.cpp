@@ -1,17 +1,14 @@
 #include "plugins/cmd_processor.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <stdio.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
-#include <chrono>
-#include <cstdlib>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
@@ -21,191 +18,128 @@ namespace Orvane {
 namespace {
 
 using Clock = std::chrono::steady_clock;
+using std::chrono::seconds;
 
 class CmdProcessorTest : public testing::Test {
 protected:
-    void SetUp() override {
-        char pattern[] = "/tmp/cmd_processor_testXXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        dir_ = pattern;
-    }
-    void TearDown() override {
-        uint64_t freed = 0;
-        FileUtil::DeleteDirectoryOrFile(dir_, freed, true);
-    }
+    void TearDown() override { unlink(script_.c_str()); }
 
-    std::string WriteScript(const std::string& name, const std::string& body) {
-        std::string path = dir_ + "/" + name;
-        EXPECT_TRUE(FileUtil::SaveStringToFile(path, "#!/bin/sh\n" + body + "\n", true));
-        chmod(path.c_str(), 0755);
-        return path;
+    std::string WriteScript(const std::string& body) {
+        EXPECT_TRUE(FileUtil::SaveStringToFile(script_, "#!/bin/sh\n" + body + "\n", true));
+        chmod(script_.c_str(), 0755);
+        return script_;
     }
 
     // Runs the command with its output into a file and returns what it wrote.
-    std::string Run(const std::string& command, int timeoutSeconds, bool* ok = nullptr) {
-        std::string out = dir_ + "/out.txt";
-        int fd = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-        EXPECT_GE(fd, 0);
-        bool result = CmdProcessor::WriteCommandResultToFileWithTimeout(fd, command, timeoutSeconds);
-        close(fd);
-        if (ok != nullptr) {
-            *ok = result;
-        }
-        std::string content;
-        FileUtil::LoadStringFromFile(out, content);
+    static std::string Run(const std::string& command, int timeoutSeconds) {
+        FILE* out = tmpfile();
+        EXPECT_TRUE(CmdProcessor::WriteCommandResultToFileWithTimeout(fileno(out), command, timeoutSeconds));
+        std::string content(4096, '\0');
+        content.resize(std::max<ssize_t>(0, pread(fileno(out), &content[0], content.size(), 0)));
+        fclose(out);
         return content;
     }
 
-    std::string dir_;
+    const std::string script_ = "/tmp/cmd_processor_test_" + std::to_string(getpid()) + ".sh";
 };
 
 TEST_F(CmdProcessorTest, OutputAndExitCodesOfFinishedCommands) {
+    std::string selfKill = WriteScript("echo before\nkill -9 $$");
+    struct { std::string command, output, logged; } cases[] = {
+        {"echo hello  world", "hello  world\n", ""},  // two blanks: an empty word between
+        {"false", "", "command 'false' failed: exit code 1"},
+        {selfKill, "before\n", "command '" + selfKill + "' failed: killed by signal 9"},
+        {"/nonexistent/program --flag", "", "command '/nonexistent/program --flag' failed: exit code 1"},
+    };
     LogCapture log;
-    bool ok = false;
-    EXPECT_EQ(Run("echo hello  world", 10, &ok), "hello  world\n");  // two blanks: an empty word between
-    EXPECT_TRUE(ok);
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "failed"));
-
-    EXPECT_EQ(Run("false", 10, &ok), "");
-    EXPECT_TRUE(ok);
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "WriteCommandResultToFileWithTimeout command 'false' failed: exit code 1"))
-        << log.Dump();
-
-    Run("/nonexistent/program --flag", 10, &ok);
-    EXPECT_TRUE(ok);
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.command);
+        log.Clear();
+        EXPECT_EQ(c.output, Run(c.command, 10));
+        EXPECT_EQ(c.logged.empty() ? 0u : 1u, log.Count(ANDROID_LOG_INFO, "failed")) << log.Dump();
+        EXPECT_TRUE(c.logged.empty() || log.Contains(ANDROID_LOG_INFO, "ToFileWithTimeout " + c.logged));
+    }
 #if !defined(__SANITIZE_THREAD__)  // ThreadSanitizer turns vfork into fork: the child's line stays there
     EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "WriteCommandResultToFileWithTimeout execvp, start will not log"));
 #endif
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "command '/nonexistent/program --flag' failed: exit code 1"));
-
-    std::string selfKill = WriteScript("self_kill.sh", "echo before\nkill -9 $$");
-    EXPECT_EQ(Run(selfKill, 10, &ok), "before\n");
-    EXPECT_TRUE(ok);
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "command '" + selfKill + "' failed: killed by signal 9"));
-
     log.Clear();
     EXPECT_FALSE(CmdProcessor::WriteCommandResultToFileWithTimeout(1, "", 10));
     EXPECT_TRUE(log.Lines().empty());
 }
 
 TEST_F(CmdProcessorTest, OverrunIsTerminatedThenKilled) {
-    LogCapture log;
-    std::string slow = WriteScript("slow.sh", "echo started\nexec sleep 60");
-    auto start = Clock::now();
-    bool ok = false;
-    EXPECT_EQ(Run(slow, 1, &ok), "started\n");
-    EXPECT_TRUE(ok);
-    EXPECT_LT(Clock::now() - start, std::chrono::seconds(30));
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "WriteCommandResultToFileWithTimeout command '" + slow + "' timed out, (killing pid"))
-        << log.Dump();
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "even with SIGKILL"));
-
-    // An ignored SIGTERM survives exec, so the sleep itself shrugs it off and needs SIGKILL.
-    log.Clear();
-    std::string stubborn = WriteScript("stubborn.sh", "trap '' TERM\nexec sleep 60");
-    start = Clock::now();
-    Run(stubborn, 1, &ok);
-    auto elapsed = Clock::now() - start;
-    EXPECT_TRUE(ok);
-    EXPECT_GE(elapsed, std::chrono::seconds(5));  // the SIGTERM grace period was spent
-    EXPECT_LT(elapsed, std::chrono::seconds(30));
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "timed out"));
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "even with SIGKILL"));
+    // An ignored SIGTERM survives exec: that sleep shrugs it off and needs SIGKILL after the grace.
+    struct { std::string body; seconds atLeast; } cases[] = {{"echo started\nexec sleep 60", seconds(0)},
+                 {"echo started\ntrap '' TERM\nexec sleep 60", seconds(5)}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.body);
+        LogCapture log;
+        std::string script = WriteScript(c.body);
+        auto start = Clock::now();
+        EXPECT_EQ("started\n", Run(script, 1));
+        EXPECT_GE(Clock::now() - start, c.atLeast);
+        EXPECT_LT(Clock::now() - start, seconds(30));
+        EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "ToFileWithTimeout command '" + script + "' timed out, (killing pid"));
+        EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "even with SIGKILL"));
+    }
 }
 
 // The daemon's situation: SIGCHLD blocked in every thread, several threads running, children
 // reaped elsewhere (pclose) leaving their signal pending.
 TEST_F(CmdProcessorTest, ReapsAtOnceWithSigchldBlockedInEveryThread) {
-    sigset_t childSignal;
-    sigset_t oldMask;
+    sigset_t childSignal, oldMask;
     sigemptyset(&childSignal);
     sigaddset(&childSignal, SIGCHLD);
     ASSERT_EQ(pthread_sigmask(SIG_BLOCK, &childSignal, &oldMask), 0);
-
     std::atomic<bool> stop{false};
-    std::vector<std::thread> busy;
-    for (int i = 0; i < 3; ++i) {
-        busy.emplace_back([&stop] {
-            while (!stop) {
-                std::this_thread::yield();
-            }
-        });
-    }
-
+    std::vector<std::thread> busy(3);
+    for (auto& thread : busy) thread = std::thread([&stop] { while (!stop) std::this_thread::yield(); });
     LogCapture log;
     std::string line;
     ASSERT_TRUE(CmdProcessor::GetCommandResult("echo pending", line));  // leaves a SIGCHLD pending
-
     auto start = Clock::now();
     EXPECT_EQ(Run("true", 30), "");
-    EXPECT_LT(Clock::now() - start, std::chrono::seconds(15));
-
+    EXPECT_LT(Clock::now() - start, seconds(15));
     // A command that outlives the first poll must not be mistaken for a stale signal's child.
-    std::string sleeper = WriteScript("sleeper.sh", "sleep 0.3\necho done");
-    EXPECT_EQ(Run(sleeper, 30), "done\n");
-
+    EXPECT_EQ(Run(WriteScript("sleep 0.3\necho done"), 30), "done\n");
     // The command starts with nothing blocked.
     std::string mask = Run("grep SigBlk /proc/self/status", 30);
     EXPECT_NE(mask.find("SigBlk:\t0000000000000000"), std::string::npos) << mask;
-
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "timed out")) << log.Dump();
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "instead")) << log.Dump();
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "Error")) << log.Dump();
-
+    for (const char* bad : {"timed out", "instead", "Error"}) EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, bad)) << bad;
     stop = true;
-    for (auto& thread : busy) {
-        thread.join();
-    }
+    for (auto& thread : busy) thread.join();
     pthread_sigmask(SIG_SETMASK, &oldMask, nullptr);
 }
 
-TEST_F(CmdProcessorTest, WaitPidWithTimeoutTimesOutWithEtimedout) {
+TEST_F(CmdProcessorTest, WaitPidTimesOutWithEtimedoutAndProcessNameIsItsCmdline) {
     pid_t child = fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        pause();
-        _exit(0);
-    }
+    if (child == 0) _exit(execlp("sleep", "sleep", "30", static_cast<char*>(nullptr)));
+    ASSERT_GT(child, 0);
     errno = 0;
     EXPECT_FALSE(CmdProcessor::WaitPidWithTimeout(child, 1, nullptr));
     EXPECT_EQ(errno, ETIMEDOUT);
+    EXPECT_EQ(CmdProcessor::GetProcNameByPid(child), std::string("sleep\0" "30", 8));
     kill(child, SIGKILL);
     int status = 0;
     EXPECT_TRUE(CmdProcessor::WaitPidWithTimeout(child, 10, &status));
-    EXPECT_TRUE(WIFSIGNALED(status));
-    EXPECT_EQ(WTERMSIG(status), SIGKILL);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+    EXPECT_EQ(CmdProcessor::GetProcNameByPid(child), "");  // reaped: gone
+    EXPECT_EQ(CmdProcessor::GetProcNameByPid(-5), "");
 }
 
 TEST_F(CmdProcessorTest, FirstLineOfShellOutput) {
     std::string result = "previous";
-    EXPECT_TRUE(CmdProcessor::GetCommandResult("printf 'one\\ntwo\\nthree\\n'", result));
-    EXPECT_EQ(result, "one\n");
-    EXPECT_TRUE(CmdProcessor::GetCommandResult("printf 'no line end'", result));
-    EXPECT_EQ(result, "no line end");
-    EXPECT_TRUE(CmdProcessor::GetCommandResult("true", result));
-    EXPECT_EQ(result, "no line end");  // no output keeps the old value
-    std::string longLine(600, 'x');
-    EXPECT_TRUE(CmdProcessor::GetCommandResult("printf '" + longLine + "'", result));
-    EXPECT_EQ(result, std::string(511, 'x'));
-    EXPECT_FALSE(CmdProcessor::GetCommandResult("", result));
-}
-
-TEST_F(CmdProcessorTest, ProcessNameByPid) {
-    std::string name = CmdProcessor::GetProcNameByPid(getpid());
-    EXPECT_EQ(std::string(name.c_str()), std::string(program_invocation_name));
-
-    pid_t child = fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        execlp("sleep", "sleep", "30", static_cast<char*>(nullptr));
-        _exit(1);
+    const std::pair<std::string, std::string> cases[] = {
+        {"printf 'one\\ntwo\\nthree\\n'", "one\n"},
+        {"printf 'no line end'", "no line end"},
+        {"true", "no line end"},  // no output keeps the old value
+        {"printf '" + std::string(600, 'x') + "'", std::string(511, 'x')},
+    };
+    for (const auto& c : cases) {
+        EXPECT_TRUE(CmdProcessor::GetCommandResult(c.first, result));
+        EXPECT_EQ(c.second, result) << c.first;
     }
-    ASSERT_TRUE(WaitUntil([&] { return CmdProcessor::GetProcNameByPid(child) == std::string("sleep\0" "30", 8); }))
-        << CmdProcessor::GetProcNameByPid(child);
-    kill(child, SIGKILL);
-    EXPECT_TRUE(CmdProcessor::WaitPidWithTimeout(child, 10, nullptr));
-    EXPECT_EQ(CmdProcessor::GetProcNameByPid(child), "");  // reaped: gone
-    EXPECT_EQ(CmdProcessor::GetProcNameByPid(-5), "");
+    EXPECT_FALSE(CmdProcessor::GetCommandResult("", result));
 }
 
 }  // namespace

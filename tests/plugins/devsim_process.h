@@ -5,7 +5,6 @@
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/prctl.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -19,19 +18,16 @@ namespace Orvane {
 // orvane-devsim serving a fresh folder, for as long as the object lives.
 class DevSim {
 public:
-    // False with the emulator's own one-line reason when FUSE cannot be mounted here.
-    bool Start(std::string* failure) {
+    // False with the emulator's own one-line reason when FUSE cannot be mounted (in a fresh
+    // folder unless one is given).
+    bool Start(std::string* failure, const char* mountAt = nullptr) {
         char folderTemplate[] = "/tmp/orvane-devsim-test-XXXXXX";
-        if (mkdtemp(folderTemplate) == nullptr) {
-            *failure = "cannot create a mount folder";
-            return false;
-        }
-        folder = folderTemplate;
         int errPipe[2];
-        if (pipe2(errPipe, O_CLOEXEC) != 0) {
-            *failure = "cannot create a pipe";
+        if ((mountAt == nullptr && mkdtemp(folderTemplate) == nullptr) || pipe2(errPipe, O_CLOEXEC) != 0) {
+            *failure = "cannot create a mount folder or a pipe";
             return false;
         }
+        folder = mountAt != nullptr ? mountAt : folderTemplate;
         std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane-devsim";
         pid = fork();
         if (pid == 0) {
@@ -41,23 +37,18 @@ public:
             _exit(127);
         }
         close(errPipe[1]);
-        std::string node = Path("qxev");
-        bool mounted = WaitUntil([&] {
-            struct stat st;
-            return stat(node.c_str(), &st) == 0 || waitpid(pid, nullptr, WNOHANG) == pid;
-        });
-        struct stat st;
-        if (!mounted || stat(node.c_str(), &st) != 0) {
+        auto mounted = [this] { return access(Path("qxev").c_str(), F_OK) == 0; };
+        WaitUntil([&] { return mounted() || waitpid(pid, nullptr, WNOHANG) == pid; });
+        bool ok = mounted();
+        if (!ok) {
             char reason[512] = {};
             fcntl(errPipe[0], F_SETFL, O_NONBLOCK);
             ssize_t length = read(errPipe[0], reason, sizeof(reason) - 1);
             *failure = length > 0 ? std::string(reason, length) : "orvane-devsim did not start: " + program;
-            close(errPipe[0]);
             Stop();
-            return false;
         }
         close(errPipe[0]);
-        return true;
+        return ok;
     }
     ~DevSim() { Stop(); }
 
@@ -66,10 +57,7 @@ public:
     // One write, one record, as a driver queues it.
     bool Inject(const std::string& node, const std::string& record) const {
         int fd = open(Path(node).c_str(), O_WRONLY | O_CLOEXEC);
-        if (fd < 0) {
-            return false;
-        }
-        bool written = write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
+        bool written = fd >= 0 && write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
         close(fd);
         return written;
     }

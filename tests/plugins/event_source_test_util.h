@@ -6,15 +6,13 @@
 
 #include <pthread.h>
 #include <signal.h>
+#include <sys/stat.h>
 
 #include <atomic>
-#include <chrono>
 #include <initializer_list>
 #include <map>
 #include <mutex>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "platform/pipeline.h"
 #include "platform/plugin.h"
@@ -37,17 +35,14 @@ public:
         std::lock_guard<std::mutex> guard(lock);
         return events;
     }
-    size_t Count() const {
-        std::lock_guard<std::mutex> guard(lock);
-        return events.size();
-    }
+    size_t Count() const { return Events().size(); }
 
 private:
     mutable std::mutex lock;
     std::vector<sp<Event>> events;
 };
 
-// Connects a source to a pipeline holding only `recorder`.
+// Connects a source to a pipeline holding only a new recorder.
 inline sp<RecordingPlugin> AttachRecorder(const sp<EventSource>& source) {
     sp<RecordingPlugin> recorder = new RecordingPlugin();
     source->AddPipeline("dftFaultEvent", new Pipeline("dftFaultEvent", {recorder}));
@@ -68,9 +63,7 @@ public:
     std::string GetCloudConfigDir() override { return "/tmp/"; }
     sp<EventLoop> GetSharedWorkLoop() override { return nullptr; }
     sp<EventLoop> GetLooperByName(const std::string&) override { return nullptr; }
-    std::string GetSysProperity(const std::string&, const std::string& defaultValue) override {
-        return defaultValue;
-    }
+    std::string GetSysProperity(const std::string&, const std::string& value) override { return value; }
     bool SetSysProperity(const std::string&, const std::string&) override { return false; }
     bool PostUnorderedEvent(sp<Event>) override { return false; }
     void RegisterUnorderedEventListener(sp<EventListener>) override {}
@@ -84,14 +77,34 @@ private:
     const std::map<std::string, std::string> devices;
 };
 
+// A FIFO standing in for a device node: written in packet mode, one write is one read, and a
+// write longer than 4096 bytes arrives as several reads of at most 4096 bytes.
+struct PacketFifo {
+    PacketFifo() { mkfifo(path.c_str(), 0600); }
+    ~PacketFifo() {
+        close(writer);
+        unlink(path.c_str());
+    }
+    // The first write opens the writer end, waiting for a reader; O_DIRECT is refused at open.
+    bool Write(const std::string& record) {
+        if (writer < 0 && (writer = open(path.c_str(), O_WRONLY | O_CLOEXEC)) >= 0) {
+            fcntl(writer, F_SETFL, fcntl(writer, F_GETFL) | O_DIRECT);
+        }
+        return write(writer, record.data(), record.size()) == static_cast<ssize_t>(record.size());
+    }
+
+    const std::string path = "/tmp/orvane-fifo-" + std::to_string(getpid()) + "-" + std::to_string(gettid());
+    int writer = -1;
+};
+
 // Runs a source's StartEventSource on a thread of its own, as the platform does. The sources
-// block in select, read or epoll_wait and look at their stop flag only when such a call fails,
-// so stopping interrupts the thread with a signal until it has returned.
+// look at their stop flag only when a blocking call fails, so stopping interrupts the thread
+// with a signal (installed without SA_RESTART) until it has returned.
 class SourceRunner {
 public:
     explicit SourceRunner(sp<EventSource> source) : source(source) {
         struct sigaction action = {};
-        action.sa_handler = [](int) {};  // no SA_RESTART: blocking calls fail with EINTR
+        action.sa_handler = [](int) {};
         sigaction(SIGUSR1, &action, nullptr);
         thread = std::thread([this] {
             this->source->StartEventSource();
@@ -101,7 +114,6 @@ public:
     ~SourceRunner() { Stop(); }
 
     bool Finished() const { return finished; }
-    bool WaitFinished() { return WaitUntil([this] { return Finished(); }); }
 
     // Unloads the source and knocks it out of its blocking call; true when it returned.
     bool Stop() {
@@ -109,17 +121,12 @@ public:
             return finished;
         }
         source->OnUnload();
-        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-        while (!finished && std::chrono::steady_clock::now() < deadline) {
+        bool done = WaitUntil([this] {
             pthread_kill(thread.native_handle(), SIGUSR1);
-            WaitUntil([this] { return Finished(); }, std::chrono::milliseconds(20));
-        }
-        if (!finished) {
-            thread.detach();  // still blocked: leaking it beats hanging the test binary
-            return false;
-        }
-        thread.join();
-        return true;
+            return WaitUntil([this] { return finished.load(); }, std::chrono::milliseconds(20));
+        });
+        done ? thread.join() : thread.detach();  // still blocked: leaking it beats hanging the binary
+        return done;
     }
 
 private:

@@ -11,9 +11,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <fstream>
 #include <sstream>
-#include <string>
 
 #include "tests/common/log_capture.h"
 #include "tests/plugins/devsim_process.h"
@@ -26,32 +26,23 @@ namespace {
 std::string StoredRows(const std::string& dbPath, uint32_t eventId) {
     sqlite3* db = nullptr;
     std::string rows;
+    std::string sql = "select first_time || '|' || occured_cnt || '|' || param_list from event_info where event_id = " +
+                      std::to_string(eventId) + " order by id;";
     if (sqlite3_open_v2(dbPath.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
-        std::string sql = "select first_time, occured_cnt, param_list from event_info where event_id = " +
-                          std::to_string(eventId) + " order by id;";
-        sqlite3_exec(
-            db, sql.c_str(),
-            [](void* out, int columns, char** values, char**) {
-                std::string& text = *static_cast<std::string*>(out);
-                for (int i = 0; i < columns; ++i) {
-                    text += std::string(values[i] != nullptr ? values[i] : "NULL") + (i + 1 < columns ? "|" : "\n");
-                }
-                return 0;
-            },
-            &rows, nullptr);
+        sqlite3_exec(db, sql.c_str(), [](void* out, int, char** values, char**) {
+            *static_cast<std::string*>(out) += std::string(values[0] != nullptr ? values[0] : "NULL") + "\n";
+            return 0;
+        }, &rows, nullptr);
     }
     sqlite3_close(db);
     return rows;
 }
 
-std::string ReadFile(const std::string& path) {
-    std::ifstream in(path);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
-}
-
-size_t CountOf(const std::string& text, const std::string& part) {
+// How often the part occurs in the file.
+size_t CountIn(const std::string& path, const std::string& part) {
+    std::stringstream stream;
+    stream << std::ifstream(path).rdbuf();
+    std::string text = stream.str();
     size_t count = 0;
     for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1)) {
         ++count;
@@ -85,10 +76,8 @@ protected:
     bool StartDaemon(const std::string& devList, const std::vector<std::string>& nodes) {
         logPath = folder + "/orvane." + std::to_string(++starts) + ".log";
         std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane";
-        std::string configDir = std::string(ORVANE_SOURCE_DIR) + "/etc";
-        std::string workDir = folder + "/work";
-        std::string cloudDir = folder + "/cloud";
-        std::string properties = folder + "/properties";
+        std::string configDir = std::string(ORVANE_SOURCE_DIR) + "/etc", workDir = folder + "/work";
+        std::string cloudDir = folder + "/cloud", properties = folder + "/properties";
         daemon = fork();
         if (daemon == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
@@ -101,30 +90,18 @@ protected:
             _exit(127);
         }
         return WaitUntil([&] {
-            std::string open = OpenFiles();
-            for (const std::string& node : nodes) {
-                if (open.find(node) == std::string::npos) {
-                    return false;
-                }
-            }
-            return true;
-        });
-    }
-
-    std::string OpenFiles() const {
-        std::string fdDir = "/proc/" + std::to_string(daemon) + "/fd";
-        std::string targets;
-        if (DIR* dir = opendir(fdDir.c_str())) {
-            while (dirent* entry = readdir(dir)) {
+            std::string fdDir = "/proc/" + std::to_string(daemon) + "/fd/", open;
+            DIR* dir = opendir(fdDir.c_str());
+            for (dirent* entry; dir != nullptr && (entry = readdir(dir)) != nullptr;) {
                 char target[512];
-                ssize_t length = readlink((fdDir + "/" + entry->d_name).c_str(), target, sizeof(target));
-                if (length > 0) {
-                    targets += std::string(target, length) + "\n";
-                }
+                ssize_t length = readlink((fdDir + entry->d_name).c_str(), target, sizeof(target));
+                open += std::string(target, length > 0 ? length : 0) + "\n";
             }
-            closedir(dir);
-        }
-        return targets;
+            if (dir != nullptr) {
+                closedir(dir);
+            }
+            return std::all_of(nodes.begin(), nodes.end(), [&](const std::string& node) { return open.find(node) != std::string::npos; });
+        });
     }
 
     void StopDaemon() {
@@ -139,24 +116,19 @@ protected:
     bool WaitStored(uint32_t eventId, const std::string& expectedRows) {
         std::string copy = folder + "/snapshot.db";
         return WaitUntil([&] {
-            std::string cmd = "cp " + folder + "/work/event.db " + copy + " 2>/dev/null";
-            return system(cmd.c_str()) == 0 && StoredRows(copy, eventId) == expectedRows;
+            return system(("cp " + folder + "/work/event.db " + copy + " 2>/dev/null").c_str()) == 0 && StoredRows(copy, eventId) == expectedRows;
         }, std::chrono::seconds(20));
     }
 
-    std::string DbPath() const { return folder + "/work/event.db"; }
-
     DevSim devsim;
-    std::string folder;
-    std::string logPath;
+    std::string folder, logPath;
     pid_t daemon = -1;
     int starts = 0;
 };
 
 TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
     std::string qxev = devsim.Path("qxev");
-    std::string missing = folder + "/no_such_node";
-    ASSERT_TRUE(StartDaemon("qxev=" + qxev + ",qx_exception_log=" + missing, {qxev}));
+    ASSERT_TRUE(StartDaemon("qxev=" + qxev + ",qx_exception_log=" + folder + "/no_such_node", {qxev}));
 
     ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000000 -paraList {\"device\": \"sda\", \"errno\": 5}"));
     ASSERT_TRUE(devsim.Inject("qxev", "EventId 0 -t 1700000000 -paraList {}"));
@@ -165,11 +137,10 @@ TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
     const std::string firstDay = "1700000100|2|{\"device\": \"sda\", \"errno\": 5}\n";
     ASSERT_TRUE(WaitStored(905001001, firstDay)) << StoredRows(folder + "/snapshot.db", 905001001);
     StopDaemon();
-    EXPECT_EQ(firstDay, StoredRows(DbPath(), 905001001));
+    EXPECT_EQ(firstDay, StoredRows(folder + "/work/event.db", 905001001));
 
-    std::string log = ReadFile(logPath);
-    EXPECT_EQ(1u, CountOf(log, "openExceptionLogFd No kernel exception log monitor support (errno=2)")) << log;
-    EXPECT_EQ(2u, CountOf(log, "ParseEvent event invalid")) << log;
+    EXPECT_EQ(1u, CountIn(logPath, "openExceptionLogFd No kernel exception log monitor support (errno=2)"));
+    EXPECT_EQ(2u, CountIn(logPath, "ParseEvent event invalid"));
 
     // A second start on the same work folder adds to what is stored.
     std::string relay = devsim.Path("qx_exception_log");
@@ -179,8 +150,8 @@ TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
     const std::string secondStart = "1700000200|3|{\"device\": \"sda\", \"errno\": 5}\n";
     ASSERT_TRUE(WaitStored(905001001, secondStart)) << StoredRows(folder + "/snapshot.db", 905001001);
     StopDaemon();
-    EXPECT_EQ(secondStart, StoredRows(DbPath(), 905001001));
-    EXPECT_EQ(0u, CountOf(ReadFile(logPath), "No kernel exception log monitor support"));
+    EXPECT_EQ(secondStart, StoredRows(folder + "/work/event.db", 905001001));
+    EXPECT_EQ(0u, CountIn(logPath, "No kernel exception log monitor support"));
 }
 
 }  // namespace

@@ -3,14 +3,11 @@
 
 #include <map>
 #include <mutex>
-#include <string>
-#include <vector>
 
 #include "platform/event_loop.h"
 #include "platform/plugin_context.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 
 // A platform stand-in for the storage tests: fixed folders, properties in a map, a real shared
 // work loop, and a record of the events inserted into pipelines. Any thread may call it.
@@ -21,11 +18,6 @@ public:
         sharedLoop_->StartLoop();
     }
     ~FakePluginContext() override { sharedLoop_->StopLoop(); }
-
-    void SetProperty(const std::string& key, const std::string& value) {
-        std::lock_guard<std::mutex> lock(mutex_);
-        properties_[key] = value;
-    }
     std::vector<std::pair<std::string, sp<Event>>> Inserted() {
         std::lock_guard<std::mutex> lock(mutex_);
         return inserted_;
@@ -39,11 +31,11 @@ public:
     sp<EventLoop> GetLooperByName(const std::string&) override { return sharedLoop_; }
     std::string GetSysProperity(const std::string& key, const std::string& defaultValue) override {
         std::lock_guard<std::mutex> lock(mutex_);
-        auto it = properties_.find(key);
-        return it == properties_.end() ? defaultValue : it->second;
+        return properties_.count(key) != 0 ? properties_[key] : defaultValue;
     }
     bool SetSysProperity(const std::string& key, const std::string& value) override {
-        SetProperty(key, value);
+        std::lock_guard<std::mutex> lock(mutex_);
+        properties_[key] = value;
         return true;
     }
     std::string GetDevicePath(const std::string&, const std::string& defaultPath) override { return defaultPath; }
@@ -59,16 +51,13 @@ public:
     bool RegisterPipelineListener(const std::string&, sp<Plugin>) override { return false; }
     void SetCloudConfigFolder(const std::string&) override {}
 
-private:
-    std::string workDir_;
-    std::string configDir_;
+    std::string workDir_, configDir_;
     sp<EventLoop> sharedLoop_;
     std::mutex mutex_;
     std::map<std::string, std::string> properties_;
     std::vector<std::pair<std::string, sp<Event>>> inserted_;
 };
 
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane
 
 #endif  // ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H

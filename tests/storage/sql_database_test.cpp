@@ -1,323 +1,223 @@
+// The SQL layer: statement and query texts, the schema of a file and its upgrade, and files that
+// are hostile, broken, read-only or full.
+
 #include "storage/sql_database.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
+#include <sqlite3.h>
 
-#include <fstream>
-#include <sstream>
+#include <atomic>
 
+#include "storage/event_database.h"
+#include "storage/event_query.h"
 #include "storage/event_table.h"
 #include "tests/common/log_capture.h"
-#include "tests/storage/faulty_vfs.h"
 #include "tests/storage/storage_test_util.h"
 
-namespace android {
-namespace Orvane {
-namespace {
+namespace android::Orvane {
 
-class TwoColumnTable : public BaseTable {
-public:
-    TwoColumnTable() : BaseTable("t") {
-        AddField(new SqlField("a", SqlFieldType::INTEGER, false));
-        AddField(new SqlField("b", SqlFieldType::TEXT));
+// An SQLite file system that wraps the platform's and can pretend that the disk is full (every
+// write fails with SQLITE_FULL once a byte budget is spent) or that every database file it opens
+// is read-only. Installed as the default, so the code under test opens files as usual.
+struct FaultyVfs {
+    static inline std::atomic<int64_t> writeBudget{-1};  // bytes still writable; -1 means unlimited
+    static inline std::atomic<bool> readOnly{false};
+    static inline sqlite3_vfs *real = nullptr, vfs;
+    static inline const sqlite3_io_methods* realIo = nullptr;
+    static inline sqlite3_io_methods io;
+
+    static int Write(sqlite3_file* file, const void* buffer, int size, sqlite3_int64 offset) {
+        int64_t budget = writeBudget.load();
+        if (budget >= 0)
+            writeBudget = budget < size ? 0 : budget - size;
+        return budget >= 0 && budget < size ? SQLITE_FULL : realIo->xWrite(file, buffer, size, offset);
     }
-};
-
-class EmptyTable : public BaseTable {
-public:
-    EmptyTable() : BaseTable("empty") {}
-};
-
-std::string ReadFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream content;
-    content << in.rdbuf();
-    return content.str();
-}
-
-std::string IntegrityOf(const sp<SqlDatabase>& db) {
-    auto rows = db->QueryRecord("PRAGMA integrity_check", {"integrity_check"});
-    return rows.empty() ? "no answer: " + db->GetLastError() : rows[0]["integrity_check"];
-}
-
-size_t CountRows(const sp<SqlDatabase>& db, const std::string& table) {
-    auto rows = db->QueryRecord("select count(*) from " + table, {"n"});
-    return rows.empty() ? 0 : std::stoul(rows[0]["n"]);
-}
-
-std::string Clause(const sp<SqlField>& field) {
-    return field->GetFieldStatement();
-}
-
-TEST(SqlFieldTest, ClausesAndCreateStatement) {
-    EXPECT_EQ(Clause(new SqlField("id", SqlFieldType::INTEGER, true, true, false)),
-              "id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT");
-    EXPECT_EQ(Clause(new SqlField("r", SqlFieldType::REAL)), "r REAL");
-    EXPECT_EQ(Clause(new SqlField("s", SqlFieldType::TEXT, false)), "s TEXT NOT NULL");
-    // An unknown type leaves the clause ending in the blank.
-    EXPECT_EQ(Clause(new SqlField("u", static_cast<SqlFieldType>(9))), "u ");
-    EXPECT_EQ(Clause(new SqlField("p", SqlFieldType::INTEGER, true, false, true)), "p INTEGER PRIMARY KEY");
-
-    sp<BaseTable> table = new TwoColumnTable();
-    EXPECT_EQ(table->GenerateCreateTableStatement(), "create table IF NOT EXISTS t(a INTEGER NOT NULL,b TEXT)");
-    EXPECT_EQ(table->GetFieldNameList(), (std::vector<std::string>{"a", "b"}));
-    ASSERT_NE(table->GetField("b"), nullptr);
-    EXPECT_EQ(table->GetField("b")->GetType(), SqlFieldType::TEXT);
-    EXPECT_EQ(table->GetField("B"), nullptr);
-    EXPECT_EQ(sp<BaseTable>(new EmptyTable())->GenerateCreateTableStatement(), "");
-}
-
-TEST(BaseTableTest, InsertAndUpdateTexts) {
-    sp<BaseTable> raw = new RawEventTable();
-    EXPECT_EQ(raw->BuildInsertStatement({"event_id", "extra_data"}, {"7", "a'b"}),
-              "insert into raw_events (event_id,extra_data)  values ( 7,'a''b') ");
-    // Unknown names are skipped together with their values; INTEGER values stay verbatim.
-    EXPECT_EQ(raw->BuildInsertStatement({"nope", "event_id", "param_list"}, {"x", "it's", "it's"}),
-              "insert into raw_events (event_id,param_list)  values ( it's,'it''s') ");
-    EXPECT_EQ(raw->BuildInsertStatement({"nope"}, {"1"}), "");
-    EXPECT_EQ(raw->BuildInsertStatement({}, {}), "");
-    // Extra values beyond the names are ignored.
-    EXPECT_EQ(raw->BuildInsertStatement({"timestamp"}, {"5", "6"}),
-              "insert into raw_events (timestamp)  values ( 5) ");
-
-    EXPECT_EQ(raw->BuildUpdateStatement({"event_id", "nope", "extra_data"}, {"7", "z", "it's"}),
-              "update raw_events set event_id=7, extra_data='it''s'");
-    EXPECT_EQ(raw->BuildUpdateStatement({"nope"}, {"7"}), "");
-    EXPECT_EQ(raw->BuildUpdateStatement({}, {}), "");
-}
-
-TEST(SqlDatabaseTest, OpenCloseAndExecute) {
-    TempDir dir;
-    LogCapture log;
-    sp<SqlDatabase> noPath = new SqlDatabase("");
-    EXPECT_FALSE(noPath->Open());
-    EXPECT_FALSE(log.Contains(ANDROID_LOG_ERROR, "failed open db"));
-
-    sp<SqlDatabase> missingFolder = new SqlDatabase(dir.File("no/such/folder/x.db"));
-    EXPECT_FALSE(missingFolder->Open());
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_ERROR, "Open failed open db " + dir.File("no/such/folder/x.db")));
-    EXPECT_FALSE(missingFolder->IsOpen());
-
-    std::string path = dir.File("t.db");
-    sp<SqlDatabase> db = new SqlDatabase(path);
-    EXPECT_FALSE(db->Execute("select 1", false));  // no connection yet
-    ASSERT_TRUE(db->Open());
-    struct stat st {};
-    ASSERT_EQ(stat(path.c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode & 0777, 0640u);
-    auto pragma = db->QueryRecord("PRAGMA cache_size", {"cache_size"});
-    ASSERT_EQ(pragma.size(), 1u);
-    EXPECT_EQ(pragma[0]["cache_size"], "10");
-    pragma = db->QueryRecord("PRAGMA synchronous", {"synchronous"});
-    ASSERT_EQ(pragma.size(), 1u);
-    EXPECT_EQ(pragma[0]["synchronous"], "1");
-
-    EXPECT_FALSE(db->ExecuteSql("select * from nowhere"));
-    EXPECT_NE(db->GetLastError().find("no such table"), std::string::npos);
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_WARN, "ExecuteSql failed execute sql " + path +
-                                                   ", err:no such table: nowhere, sql:select * from nowhere"));
-    // The last error is cleared by the next statement.
-    EXPECT_TRUE(db->ExecuteSql("create table t(a INTEGER NOT NULL,b TEXT)"));
-    EXPECT_EQ(db->GetLastError(), "");
-
-    // Reopening an open database keeps working on the same file.
-    EXPECT_TRUE(db->ExecuteSql("insert into t (a,b) values (1,'x')"));
-    ASSERT_TRUE(db->Open());
-    EXPECT_EQ(CountRows(db, "t"), 1u);
-    db->Close();
-    EXPECT_FALSE(db->IsOpen());
-    EXPECT_TRUE(db->QueryRecord("select a from t", {"a"}).empty());
-    db->Close();  // twice is harmless
-}
-
-TEST(SqlDatabaseTest, QueryRecordKeysRowsByExpectedNames) {
-    TempDir dir;
-    sp<SqlDatabase> db = new SqlDatabase(dir.File("q.db"));
-    ASSERT_TRUE(db->Open());
-    ASSERT_TRUE(db->ExecuteSql("create table t(a INTEGER, b TEXT, c TEXT)"));
-    ASSERT_TRUE(db->ExecuteSql("insert into t values (1, NULL, 'x'), (2, 'y', NULL), (3, '', 'z')"));
-
-    LogCapture log;
-    // Three columns against two names: every row is dropped with its own line, none kept.
-    EXPECT_TRUE(db->QueryRecord("select a,b,c from t", {"a", "b"}).empty());
-    EXPECT_EQ(log.Count(ANDROID_LOG_ERROR, "GetExecResult failed result cnt=3,expCnt=2,"), 3u);
-
-    // Rows are keyed by the given names, not by SQLite's; NULL reads as "".
-    auto rows = db->QueryRecord("select a,b from t order by a", {"first", "second"});
-    ASSERT_EQ(rows.size(), 3u);
-    EXPECT_EQ(rows[0], (SqlRow{{"first", "1"}, {"second", ""}}));
-    EXPECT_EQ(rows[1], (SqlRow{{"first", "2"}, {"second", "y"}}));
-    // A repeated name keeps the later column.
-    rows = db->QueryRecord("select a,c from t order by a limit 1", {"k", "k"});
-    ASSERT_EQ(rows.size(), 1u);
-    EXPECT_EQ(rows[0], (SqlRow{{"k", "x"}}));
-
-    log.Clear();
-    EXPECT_TRUE(db->QueryRecord("select a from missing", {"a"}).empty());
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_ERROR, "QueryRecord failed QueryRecord " + dir.File("q.db") +
-                                                    ", err:no such table: missing, sql:select a from missing"));
-    // The callback ignores calls without a database or without data.
-    char* value = nullptr;
-    EXPECT_EQ(SqlDatabase::GetExecResult(nullptr, 1, &value, &value), 0);
-    db->Close();  // the destructor leaves closing to the owner
-}
-
-TEST(SqlDatabaseTest, TruncateTableRestartsIds) {
-    TempDir dir;
-    sp<SqlDatabase> db = new SqlDatabase(dir.File("t.db"));
-    ASSERT_TRUE(db->Open());
-    sp<BaseTable> raw = new RawEventTable();
-    ASSERT_TRUE(db->ExecuteSql(raw->GenerateCreateTableStatement()));
-    for (int i = 0; i < 3; i++) {
-        ASSERT_TRUE(db->ExecuteSql(raw->BuildInsertStatement({"event_id", "timestamp"}, {"1", "2"})));
+    // Opens with the platform's file system, then sends the file's writes through Write.
+    static int Open(sqlite3_vfs*, sqlite3_filename name, sqlite3_file* file, int flags, int* outFlags) {
+        if (readOnly && (flags & SQLITE_OPEN_MAIN_DB) != 0)
+            flags = (flags & ~(SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)) | SQLITE_OPEN_READONLY;
+        int rc = real->xOpen(real, name, file, flags, outFlags);
+        if (rc == SQLITE_OK && realIo == nullptr)
+            io = *(realIo = file->pMethods), io.xWrite = Write;
+        if (rc == SQLITE_OK && file->pMethods == realIo)
+            file->pMethods = &io;
+        return rc;
     }
-    ASSERT_TRUE(db->TruncateTable("raw_events"));
-    EXPECT_EQ(CountRows(db, "raw_events"), 0u);
-    ASSERT_TRUE(db->ExecuteSql(raw->BuildInsertStatement({"event_id", "timestamp"}, {"1", "2"})));
-    auto rows = db->QueryRecord("select id from raw_events", {"id"});
-    ASSERT_EQ(rows.size(), 1u);
-    EXPECT_EQ(rows[0]["id"], "1");
-
-    LogCapture log;
-    EXPECT_FALSE(db->TruncateTable("missing"));
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_WARN, "TruncateTable failed truncate table " + dir.File("t.db") +
-                                                   ":missing, no such table: missing"))
-        << log.Dump();
-    db->Close();
-    EXPECT_FALSE(db->TruncateTable("raw_events"));
-}
-
-TEST(SqlDatabaseTest, HostileTextsRoundTripByteExact) {
-    TempDir dir;
-    sp<SqlDatabase> db = new SqlDatabase(dir.File("h.db"));
-    ASSERT_TRUE(db->Open());
-    sp<BaseTable> raw = new RawEventTable();
-    ASSERT_TRUE(db->ExecuteSql(raw->GenerateCreateTableStatement()));
-    std::string megabyte(1 << 20, 'q');
-    for (size_t i = 0; i < megabyte.size(); i += 997) {
-        megabyte[i] = "'%;\"\\"[i % 5];
-    }
-    const std::vector<std::string> texts = {
-        "it's",
-        "''''",
-        "100% sure_%",
-        "a; b; c;",
-        "'; drop table event_info; --",
-        "x'); delete from raw_events; insert into raw_events (event_id) values ('",
-        "\xff\xfe\xc3\x28 invalid \xe2\x82",
-        "line\nbreak\ttab\r",
-        "",
-        megabyte,
-    };
-    for (const auto& text : texts) {
-        ASSERT_TRUE(db->ExecuteSql(raw->BuildInsertStatement({"event_id", "timestamp", "param_list"},
-                                                           {"1", "2", text})));
-    }
-    auto rows = db->QueryRecord("select param_list from raw_events order by id", {"param_list"});
-    ASSERT_EQ(rows.size(), texts.size());
-    for (size_t i = 0; i < texts.size(); i++) {
-        EXPECT_EQ(rows[i]["param_list"], texts[i]) << "text " << i;
-    }
-    EXPECT_EQ(IntegrityOf(db), "ok");
-    db->Close();
-}
-
-TEST(SqlDatabaseTest, FileThatIsNotADatabaseIsLeftAlone) {
-    TempDir dir;
-    std::string path = dir.File("garbage.db");
-    std::string garbage(8192, '\x5a');
-    garbage.replace(0, 19, "this is no database");
-    {
-        std::ofstream out(path, std::ios::binary);
-        out << garbage;
-    }
-    LogCapture log;
-    sp<SqlDatabase> db = new SqlDatabase(path);
-    db->Open();  // SQLite reads the header lazily, so the open itself may still succeed
-    EXPECT_FALSE(db->ExecuteSql("create table t(a INTEGER)"));
-    EXPECT_NE(db->GetLastError().find("not a database"), std::string::npos) << db->GetLastError();
-    EXPECT_TRUE(db->QueryRecord("select a from t", {"a"}).empty());
-    db->Close();
-    EXPECT_EQ(ReadFile(path), garbage);
-}
-
-class FaultyDiskTest : public ::testing::Test {
-protected:
-    void SetUp() override { FaultyVfs::Install(); }
-    void TearDown() override { FaultyVfs::Heal(); }
-
-    // A database with `count` committed rows of about 1 KiB each.
-    void Fill(const sp<SqlDatabase>& db, int count) {
-        ASSERT_TRUE(db->ExecuteSql(raw_->GenerateCreateTableStatement()));
-        for (int i = 0; i < count; i++) {
-            ASSERT_TRUE(InsertRow(db, i));
+    // Makes the faulty file system the default one; idempotent.
+    static void Install() {
+        if (real == nullptr) {
+            sqlite3_initialize();
+            vfs = *(real = sqlite3_vfs_find(nullptr));
+            vfs.pNext = nullptr;
+            vfs.zName = "faulty";
+            vfs.xOpen = Open;
+            sqlite3_vfs_register(&vfs, 1);
         }
     }
-    bool InsertRow(const sp<SqlDatabase>& db, int i) {
-        return db->ExecuteSql(raw_->BuildInsertStatement({"event_id", "timestamp", "param_list"},
-                                                       {std::to_string(i), "0", std::string(1024, 'a' + i % 26)}));
+    // Restores a healthy disk.
+    static void Heal() { writeBudget = -1, readOnly = false; }
+};
+
+TEST(EventTableTest, StatementTexts) {
+    const auto create = [](BaseTable* table) { return sp<BaseTable>(table)->GenerateCreateTableStatement(); };
+    sp<BaseTable> raw = new RawEventTable();
+    // TEXT is quoted and escaped, INTEGER stands verbatim; unknown names are skipped with their values.
+    const Texts names = {"nope", "timestamp", "param_list"}, values = {"x", "5", "'; drop table event_info; --", "6"};
+    const std::pair<std::string, std::string> texts[] = {
+            {create(new EventTable()),
+             "create table IF NOT EXISTS event_info(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,event_id "
+             "INTEGER NOT NULL,trace_id TEXT,pspan_id TEXT,span_id TEXT,version_id INTEGER NOT NULL,occured_cnt "
+             "INTEGER,first_time INTEGER,param_list TEXT,expire INTEGER,visible INTEGER)"},
+            {create(new EventDailyTable()),
+             "create table IF NOT EXISTS event_daily(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,event_id "
+             "INTEGER NOT NULL,daily_cnt INTEGER NOT NULL,over_cnt INTEGER NOT NULL,hour_cnt INTEGER NOT NULL,"
+             "next_expire_time INTEGER,last_happen_time INTEGER,last_log_time INTEGER)"},
+            {create(new EventVersionTable()),
+             "create table IF NOT EXISTS version(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,version TEXT NOT NULL)"},
+            {create(new EventDBVersionTable()),
+             "create table IF NOT EXISTS db_version(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,db_version "
+             "INTEGER NOT NULL,dev_version TEXT NOT NULL,start_time INTEGER NOT NULL,activate_time INTEGER)"},
+            {create(new EventUploadTable()),
+             "create table IF NOT EXISTS upload(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,year INTEGER NOT "
+             "NULL,m1 TEXT,m2 TEXT,m3 TEXT,m4 TEXT,m5 TEXT,M6 TEXT,M7 TEXT,M8 TEXT,m9 TEXT,m10 TEXT,m11 TEXT,"
+             "m12 TEXT)"},
+            {create(new RawEventTable()),
+             "create table IF NOT EXISTS raw_events(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,event_id "
+             "INTEGER NOT NULL,extra_data TEXT,timestamp INTEGER NOT NULL,param_list TEXT)"},
+            {raw->BuildInsertStatement(names, values),
+             "insert into raw_events (timestamp,param_list)  values ( 5,'''; drop table event_info; --') "},
+            {raw->BuildUpdateStatement(names, values),
+             "update raw_events set timestamp=5, param_list='''; drop table event_info; --'"},
+            {raw->BuildInsertStatement({"nope"}, {"1"}) + raw->BuildUpdateStatement({"nope"}, {"1"}), ""},
+    };
+    for (const auto& [built, expected] : texts)
+        EXPECT_EQ(built, expected);
+}
+
+using Q = EventQuery;
+
+TEST(EventQueryTest, ConditionWhereAndQueryTexts) {
+    // By operator value; values outside the enumeration render nothing.
+    const char* texts[] = {"",        "c = 'v'",  "c != 'v'",     "c < 'v'",          "c <= 'v'",
+                           "c > 'v'", "c >= 'v'", "c like '%v%'", "c not like '%v%'", ""};
+    for (int op = 0; op < 10; op++)
+        EXPECT_EQ(Q::GenerateCondStatement("c", Q::Op(op), "v"), texts[op]) << op;
+    EXPECT_EQ(Q::GenerateCondStatement("c", Q::LIKE, "'; drop table x; --"), "c like '%''; drop table x; --%'");
+    Q plain, groups, open, ordered, mixed;
+    // Without a select list there is no query; unknown operators add nothing, not even a connector.
+    plain.And("e", Q::EQ, 7).And("x", Q::Op(9), "1");
+    // A closed group is joined again; an open one takes the next condition without a connector.
+    groups.Select({"id"}).And("e", Q::EQ, "7").AddBeginGroup(true).And("d", Q::GT, 3).AddEndGroup();
+    groups.AddBeginGroup(false).AppendWhereStatement("a", Q::EQ, "1", false);
+    groups.AppendWhereStatement("b", Q::EQ, "2", false).AddEndGroup().Where("c", Q::LE, -5);
+    open.AddBeginGroup(false).And("a", Q::EQ, "1").AddBeginGroup(true).Where("b", Q::NE, "2");
+    // Repeated columns are selected once; ordering alone makes the WHERE part an order clause.
+    ordered.Select({"id", "db_version"}).Select({"id"}).Order("id", false);
+    // Ascending columns come first, whatever the order of the calls.
+    mixed.Select({"z"}).Order("c", false).Order("a", true).Order("b", true).And("x", Q::EQ, "1");
+    const std::tuple<Q*, std::string, std::string> cases[] = {
+            {&plain, "  where e = '7'", ""},
+            {&groups, "  where e = '7' and (d > '3')  or ( a = '1' or b = '2')  and c <= '-5'",
+             "select id from t where e = '7' and (d > '3')  or ( a = '1' or b = '2')  and c <= '-5' limit -1"},
+            {&open, "  where  (a = '1' and (b != '2'", ""},
+            {&ordered, " order by id desc", "select id,db_version from t order by id desc limit -1"},
+            {&mixed, "  where x = '1'order by a, b asc, c desc",
+             "select z from t where x = '1' order by a, b asc, c desc limit -1"},
+    };
+    for (const auto& [query, where, select] : cases) {
+        EXPECT_EQ(query->GetWhereStatement(), where);
+        EXPECT_EQ(query->BuildQueryStatement("t", -1), select);
     }
+}
+
+class SqlFileTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        FaultyVfs::Install();
+        ASSERT_TRUE(db_->Open());
+        ASSERT_TRUE(db_->ExecuteSql(raw_->GenerateCreateTableStatement()));
+    }
+    void TearDown() override { FaultyVfs::Heal(), db_->Close(); }
+    bool Insert(const std::string& params) {
+        return db_->ExecuteSql(raw_->BuildInsertStatement({"event_id", "timestamp", "param_list"}, {"1", "2", params}));
+    }
+    // The file's integrity and its number of rows, seen by a healthy connection of its own.
+    void ExpectIntact(size_t rows) {
+        db_->Close(), FaultyVfs::Heal();
+        EXPECT_EQ(Column(path_, "PRAGMA integrity_check"), Texts{"ok"});
+        EXPECT_EQ(Column(path_, "select count(*) from raw_events"), Texts{std::to_string(rows)});
+        ASSERT_TRUE(db_->Open());
+    }
+
+    TempDir dir_;
+    std::string path_ = dir_.File("t.db");
+    sp<SqlDatabase> db_ = new SqlDatabase(path_);
     sp<BaseTable> raw_ = new RawEventTable();
 };
 
-TEST_F(FaultyDiskTest, ReadOnlyFileFailsWritesAndKeepsRows) {
-    TempDir dir;
-    std::string path = dir.File("ro.db");
-    sp<SqlDatabase> db = new SqlDatabase(path);
-    ASSERT_TRUE(db->Open());
-    Fill(db, 5);
-    db->Close();
-
-    FaultyVfs::g_readOnly = true;
-    LogCapture log;
-    ASSERT_TRUE(db->Open());
-    EXPECT_FALSE(InsertRow(db, 99));
-    EXPECT_NE(db->GetLastError().find("readonly"), std::string::npos) << db->GetLastError();
-    EXPECT_TRUE(log.Contains(ANDROID_LOG_WARN, "ExecuteSql failed execute sql " + path));
-    EXPECT_FALSE(db->TruncateTable("raw_events"));
-    EXPECT_EQ(CountRows(db, "raw_events"), 5u);
-    db->Close();
-
-    FaultyVfs::Heal();
-    ASSERT_TRUE(db->Open());
-    EXPECT_EQ(IntegrityOf(db), "ok");
-    EXPECT_EQ(CountRows(db, "raw_events"), 5u);
-    db->Close();
-}
-
-TEST_F(FaultyDiskTest, FullDiskLosesNoCommittedRow) {
-    TempDir dir;
-    std::string path = dir.File("full.db");
-    sp<SqlDatabase> db = new SqlDatabase(path);
-    ASSERT_TRUE(db->Open());
-    Fill(db, 10);
-
-    // Each insert writes journal and database pages; the budget runs out within a few rows,
-    // sometimes in the middle of a commit.
-    FaultyVfs::g_writeBudget = 40000;
-    int committed = 10;
-    int failures = 0;
-    for (int i = 10; i < 60; i++) {
-        if (InsertRow(db, i)) {
-            committed++;
-        } else {
-            failures++;
-        }
+TEST_F(SqlFileTest, OldFileIsUpgradedOnce) {
+    ASSERT_TRUE(db_->ExecuteSql(
+            "create table event_daily(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,event_id INTEGER NOT NULL,"
+            "daily_cnt INTEGER NOT NULL,over_cnt INTEGER NOT NULL,hour_cnt INTEGER NOT NULL,next_expire_time INTEGER,"
+            "last_happen_time INTEGER); create table db_version(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,"
+            "db_version INTEGER NOT NULL,dev_version TEXT NOT NULL,start_time INTEGER NOT NULL,activate_time INTEGER);"
+            "insert into db_version (db_version,dev_version,start_time) values (3,'v1',100),(5,'v2',200);"
+            "insert into event_daily (event_id,daily_cnt,over_cnt,hour_cnt) values (9,1,0,1);"));
+    sp<EventDatabase> db = new EventDatabase();
+    for (size_t start = 0; start < 2; start++) {  // only the first start adds the column and raises the revision
+        LogCapture log;
+        db->InitDatabase(path_);
+        ASSERT_TRUE(db->IsInitialised());
+        db->Close();
+        EXPECT_EQ(log.Count(ANDROID_LOG_DEBUG, ":ALTER TABLE event_daily ADD COLUMN last_log_time INTEGER"), 1 - start);
+        EXPECT_EQ(log.Count(ANDROID_LOG_INFO, "UpdateTableColumn Add column "), 1 - start);
+        EXPECT_EQ(Column(path_, "select db_version from db_version order by id"), (Texts{"3", "6"}));
+        EXPECT_EQ(Column(path_, "select event_id || '/' || ifnull(last_log_time, '-') from event_daily"), Texts{"9/-"});
+        // The six tables and sqlite_sequence.
+        EXPECT_EQ(Column(path_, "select count(*) from sqlite_master where type = 'table'"), Texts{"7"});
     }
-    EXPECT_GT(failures, 0);
-    EXPECT_LT(committed, 60);
-    db->Close();
-
-    FaultyVfs::Heal();
-    ASSERT_TRUE(db->Open());
-    EXPECT_EQ(IntegrityOf(db), "ok");
-    EXPECT_EQ(CountRows(db, "raw_events"), static_cast<size_t>(committed));
-    // Once space is back, writing goes on.
-    EXPECT_TRUE(InsertRow(db, 60));
-    EXPECT_EQ(CountRows(db, "raw_events"), static_cast<size_t>(committed + 1));
-    db->Close();
 }
 
-}  // namespace
-}  // namespace Orvane
-}  // namespace android
+TEST_F(SqlFileTest, HostileTextsRoundTripByteExact) {
+    const std::string megabyte = std::string(1 << 19, '\'') + std::string(1 << 19, '%');
+    const Texts texts = {"it's", "'; drop table event_info; --", "\xff\xfe\xc3\x28", "a\nb\tc\r", "", megabyte};
+    for (const auto& text : texts)
+        ASSERT_TRUE(Insert(text));
+    EXPECT_EQ(Column(path_, "select param_list from raw_events order by id"), texts);
+    ExpectIntact(texts.size());
+}
+
+TEST_F(SqlFileTest, FileThatIsNoDatabaseFailsLoudlyAndIsLeftAlone) {
+    LogCapture log;
+    const std::string garbage = "this is no database" + std::string(8192, 'Z');
+    WriteFile(path_, garbage);
+    ASSERT_TRUE(db_->Open());  // SQLite reads the header lazily
+    EXPECT_FALSE(db_->ExecuteSql("create table t(a INTEGER)"));
+    EXPECT_TRUE(log.Contains(ANDROID_LOG_WARN, "ExecuteSql failed execute sql " + path_ +
+                                                       ", err:file is not a database, sql:create table t(a INTEGER)"));
+    EXPECT_EQ(ReadFile(path_), garbage);
+}
+
+TEST_F(SqlFileTest, ReadOnlyOrFullDiskLosesNoCommittedRow) {
+    for (int i = 0; i < 10; i++)
+        ASSERT_TRUE(Insert(std::string(1024, 'a' + i)));
+    db_->Close();
+    FaultyVfs::readOnly = true;
+    ASSERT_TRUE(db_->Open());
+    EXPECT_FALSE(Insert("x"));
+    EXPECT_NE(db_->GetLastError().find("readonly"), std::string::npos) << db_->GetLastError();
+    EXPECT_FALSE(db_->TruncateTable("raw_events"));
+    ExpectIntact(10);
+    // Each insert writes journal and database pages; the budget runs out within a few rows, sometimes
+    // in the middle of a commit.
+    FaultyVfs::writeBudget = 40000;
+    size_t committed = 10;
+    for (int i = 10; i < 60; i++)
+        committed += Insert(std::string(1024, 'a' + i % 26)) ? 1 : 0;
+    EXPECT_LT(committed, 60u);
+    ExpectIntact(committed);
+    EXPECT_TRUE(Insert("space is back"));
+    ExpectIntact(committed + 1);
+}
+
+}  // namespace android::Orvane

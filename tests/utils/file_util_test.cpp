@@ -6,246 +6,124 @@
 #include <unistd.h>
 
 #include <cstdlib>
-#include <string>
 
 #include "tests/common/log_capture.h"
 
-namespace android {
-namespace Orvane {
-namespace {
+namespace android::Orvane {
+using namespace FileUtil;
+
+const mode_t kOldMask = umask(022);  // so that no mode checked below can come from the mask
 
 class FileUtilTest : public testing::Test {
 protected:
-    void SetUp() override {
-        char templ[] = "/tmp/orvane_file_util_XXXXXX";
-        ASSERT_NE(nullptr, mkdtemp(templ));
-        root_ = templ;
-        oldMask_ = umask(022);
-    }
-    void TearDown() override {
-        umask(oldMask_);
-        std::string cmd = "rm -rf '" + root_ + "'";
-        ASSERT_EQ(0, system(cmd.c_str()));
-    }
-
-    std::string Path(const std::string& name) const { return root_ + "/" + name; }
-
-    static mode_t ModeOf(const std::string& path) {
+    void SetUp() override { ASSERT_NE(nullptr, mkdtemp(root_)); }
+    void TearDown() override { ASSERT_EQ(0, system(("rm -rf '" + Path("") + "'").c_str())); }
+    std::string Path(const std::string& name) const { return std::string(root_) + "/" + name; }
+    static uint64_t Stat(const std::string& path, bool mode) {
         struct stat st;
-        return stat(path.c_str(), &st) == 0 ? (st.st_mode & 07777) : 0;
+        return lstat(path.c_str(), &st) != 0 ? 0 : mode ? (st.st_mode & 07777) : st.st_size;
     }
-    static uint64_t StatSize(const std::string& path) {
-        struct stat st;
-        return stat(path.c_str(), &st) == 0 ? st.st_size : 0;
+    static std::string Load(const std::string& path) {
+        std::string content = "<failed>";
+        LoadStringFromFile(path, content);
+        return content;
     }
-    static void Write(const std::string& path, const std::string& content) {
-        ASSERT_TRUE(FileUtil::SaveStringToFile(path, content, true)) << path;
-    }
-
-    std::string root_;
-    mode_t oldMask_ = 0;
+    char root_[32] = "/tmp/orvane_file_util_XXXXXX";
 };
 
 TEST_F(FileUtilTest, CreateDirectoryGivesTheModeOnlyToFoldersItCreates) {
     const std::string x = Path("x");
-    ASSERT_EQ(0, mkdir(x.c_str(), 0751));
-    ASSERT_EQ(0, chmod(x.c_str(), 0751));
-
-    // 0770 cannot come from the process mask (022), so the mode is set explicitly.
-    ASSERT_TRUE(FileUtil::CreateDirectory(x + "/y/z", 0770));
-    EXPECT_EQ(0770u, ModeOf(x + "/y"));
-    EXPECT_EQ(0770u, ModeOf(x + "/y/z"));
-    EXPECT_EQ(0751u, ModeOf(x));
-
-    // An existing path is left as it is.
-    EXPECT_TRUE(FileUtil::CreateDirectory(x + "/y", 0700));
-    EXPECT_EQ(0770u, ModeOf(x + "/y"));
-
-    // Slashes at either end and doubled ones make no difference.
-    ASSERT_TRUE(FileUtil::CreateDirectory(x + "/y//q/r/", 0700));
-    EXPECT_TRUE(FileUtil::IsDirectory(x + "/y/q/r"));
-    EXPECT_EQ(0700u, ModeOf(x + "/y/q"));
-    EXPECT_EQ(0770u, ModeOf(x + "/y"));
-
-    EXPECT_TRUE(FileUtil::CreateDirectoryWithOwner(Path("owned/a"), getuid(), getgid()));
-    EXPECT_EQ(0775u, ModeOf(Path("owned/a")));
-    EXPECT_EQ(0775u, ModeOf(Path("owned")));
-}
-
-TEST_F(FileUtilTest, CreateDirectoryReportsWhatItCouldNotCreate) {
-    Write(Path("file"), "x");
+    ASSERT_TRUE(mkdir(x.c_str(), 0751) == 0 && chmod(x.c_str(), 0751) == 0);
+    // Slashes doubled or at the end change nothing; an existing folder is left as it is.
+    ASSERT_TRUE(CreateDirectory(x + "/y//z/", 0770));
+    ASSERT_TRUE(CreateDirectory(x + "/y/q", 0700) && CreateDirectory(x + "/y", 0700));
+    ASSERT_TRUE(CreateDirectoryWithOwner(Path("owned/a"), getuid(), getgid()));
+    struct { std::string path; mode_t mode; } cases[] = {
+        {x, 0751}, {x + "/y", 0770}, {x + "/y/z", 0770}, {x + "/y/q", 0700}, {Path("owned"), 0775}};
+    for (const auto& c : cases) {
+        EXPECT_EQ(c.mode, Stat(c.path, true)) << c.path;
+    }
+    ASSERT_TRUE(SaveStringToFile(Path("file"), "x", true));
     LogCapture logs;
-    const std::string wanted = Path("file/sub/deeper");
-    EXPECT_FALSE(FileUtil::CreateDirectory(wanted, 0775));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "CreateDirectory mkdir " + Path("file/sub") + " failed, " + wanted +
-                                                     ", err:Not a directory"))
+    EXPECT_FALSE(CreateDirectory(Path("file/sub/deeper"), 0775) || CreateDirectory("", 0775));
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "CreateDirectory mkdir " + Path("file/sub") + " failed, " +
+                                                     Path("file/sub/deeper") + ", err:Not a directory"))
         << logs.Dump();
-    EXPECT_FALSE(FileUtil::CreateDirectory("", 0775));
 }
 
-TEST_F(FileUtilTest, SmallQueries) {
-    const std::string file = Path("f");
-    Write(file, "12345");
-    EXPECT_TRUE(FileUtil::FileExists(file));
-    EXPECT_FALSE(FileUtil::IsDirectory(file));
-    EXPECT_TRUE(FileUtil::IsDirectory(root_));
-    EXPECT_EQ(5, FileUtil::GetFileSize(file));
-    EXPECT_TRUE(FileUtil::CheckFilePermission(file, R_OK | W_OK));
-    EXPECT_FALSE(FileUtil::CheckFilePermission(file, X_OK));
-
-    EXPECT_TRUE(FileUtil::ChangeMode(file, 0600));
-    EXPECT_EQ(0600u, ModeOf(file));
-    EXPECT_FALSE(FileUtil::ChangeMode(Path("missing"), 0600));
-
-    LogCapture logs;
-    EXPECT_EQ(0, FileUtil::GetFileSize(Path("missing")));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_INFO, "GetFileSize errno 2,err No such file or directory")) << logs.Dump();
-}
-
-TEST_F(FileUtilTest, LoadRefusesFilesOverThirtyTwoMebibytes) {
+TEST_F(FileUtilTest, LoadLimitNulTrimmingAndSaveModes) {
     const std::string big = Path("big");
-    constexpr off_t kLimit = 33554432;
+    constexpr off_t kLimit = 32 << 20;
     int fd = open(big.c_str(), O_RDWR | O_CREAT, 0644);
-    ASSERT_GE(fd, 0);
     // Sparse, so it costs no disk; markers at both ends prove the whole file was read.
-    ASSERT_EQ(0, ftruncate(fd, kLimit));
-    ASSERT_EQ(1, pwrite(fd, "A", 1, 0));
-    ASSERT_EQ(1, pwrite(fd, "Z", 1, kLimit - 1));
-    std::string content;
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(big, content));
-    ASSERT_EQ(static_cast<size_t>(kLimit), content.size());
-    EXPECT_EQ('A', content.front());
-    EXPECT_EQ('Z', content.back());
-
-    ASSERT_EQ(0, ftruncate(fd, kLimit + 1));
-    close(fd);
-    content = "kept";
-    EXPECT_FALSE(FileUtil::LoadStringFromFile(big, content));
-    EXPECT_EQ("kept", content);
-    EXPECT_FALSE(FileUtil::LoadStringFromFile(Path("missing"), content));
-    EXPECT_EQ("kept", content);
-}
-
-TEST_F(FileUtilTest, LoadTrimsNulsAndReadsFilesWithoutASize) {
-    const std::string file = Path("nuls");
-    Write(file, std::string("\0\0abc\0def\0\0", 11));
-    std::string content = "old";
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(file, content));
-    EXPECT_EQ(std::string("abc\0def", 7), content);
-
+    ASSERT_TRUE(fd >= 0 && ftruncate(fd, kLimit) == 0 && pwrite(fd, "A", 1, 0) + pwrite(fd, "Z", 1, kLimit - 1) == 2);
+    std::string content = Load(big);
+    EXPECT_TRUE(content.size() == size_t{kLimit} && content.front() == 'A' && content.back() == 'Z') << content.size();
+    ASSERT_TRUE(ftruncate(fd, kLimit + 1) == 0 && close(fd) == 0);
+    EXPECT_EQ("<failed>", Load(big));  // refused, content untouched
     // Files of /proc measure 0 bytes, yet have content.
-    ASSERT_TRUE(FileUtil::LoadStringFromFile("/proc/self/cmdline", content));
-    EXPECT_NE(std::string::npos, content.find("file_util_test"));
-}
+    EXPECT_NE(std::string::npos, Load("/proc/self/cmdline").find("file_util_test"));
 
-TEST_F(FileUtilTest, SaveTruncatesOrAppends) {
     const std::string file = Path("save");
-    EXPECT_TRUE(FileUtil::SaveStringToFile(file, "", true));
-    EXPECT_FALSE(FileUtil::FileExists(file));
-
-    ASSERT_TRUE(FileUtil::SaveStringToFile(file, "one", true));
-    ASSERT_TRUE(FileUtil::SaveStringToFile(file, "two", false));
-    std::string content;
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(file, content));
-    EXPECT_EQ("onetwo", content);
-    ASSERT_TRUE(FileUtil::SaveStringToFile(file, "three", true));
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(file, content));
-    EXPECT_EQ("three", content);
-    EXPECT_TRUE(FileUtil::SaveStringToFile(file, "", true));
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(file, content));
-    EXPECT_EQ("three", content);
-
-    EXPECT_FALSE(FileUtil::SaveStringToFile(Path("no/such/folder"), "x", true));
+    EXPECT_TRUE(SaveStringToFile(file, "", true));  // empty: nothing created
+    EXPECT_FALSE(FileExists(file));
+    ASSERT_TRUE(SaveStringToFile(file, std::string("\0\0one\0", 6), true) &&
+                SaveStringToFile(file, std::string("two\0\0", 5), false));
+    EXPECT_EQ(std::string("one\0two", 7), Load(file));
+    ASSERT_TRUE(SaveStringToFile(file, "three", true));
+    EXPECT_TRUE(SaveStringToFile(file, "", true));  // empty: the file is not touched
+    EXPECT_EQ("three", Load(file));
+    EXPECT_FALSE(SaveStringToFile(Path("no/such/folder"), "x", true));
 }
 
-TEST_F(FileUtilTest, DeleteMoveAndTheirLogLines) {
-    const std::string a = Path("a");
-    const std::string b = Path("b");
-    Write(a, "data");
+TEST_F(FileUtilTest, MoveLatestAndDeleteTreeTotals) {
+    const std::string a = Path("a"), b = Path("b");
+    ASSERT_TRUE(SaveStringToFile(a, "a", true) && MoveFile(a, b));
     LogCapture logs;
-    ASSERT_TRUE(FileUtil::MoveFile(a, b));
-    EXPECT_FALSE(FileUtil::FileExists(a));
-    EXPECT_FALSE(FileUtil::MoveFile(a, b));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR,
-                              "MoveFile move file " + a + " to " + b + " failed, err:2, No such file or directory"))
+    EXPECT_FALSE(MoveFile(a, b));
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "MoveFile move file " + a + " to " + b +
+                                                     " failed, err:2, No such file or directory"))
         << logs.Dump();
+    ASSERT_TRUE(SaveStringToFile(a, "a", true));
+    // Whole seconds count: b later within the same second is still equal.
+    struct { long aSec, aNsec, bSec, bNsec; bool aLatest, bLatest; } cases[] = {
+        {1000, 0, 1001, 0, false, true}, {1001, 100, 1001, 900000000, true, true}};
+    for (const auto& c : cases) {
+        struct timespec ta[2] = {{c.aSec, c.aNsec}, {c.aSec, c.aNsec}}, tb[2] = {{c.bSec, c.bNsec}, {c.bSec, c.bNsec}};
+        ASSERT_TRUE(utimensat(AT_FDCWD, a.c_str(), ta, 0) == 0 && utimensat(AT_FDCWD, b.c_str(), tb, 0) == 0);
+        EXPECT_EQ(c.aLatest, IsFileLatest(a, b)) << c.aSec;
+        EXPECT_EQ(c.bLatest, IsFileLatest(b, a)) << c.aSec;
+    }
+    EXPECT_TRUE(IsFileLatest(a, Path("missing")) && !IsFileLatest(Path("missing"), b));
 
-    FileUtil::DeleteFile(b);
-    EXPECT_FALSE(FileUtil::FileExists(b));
-    FileUtil::DeleteFile(b);
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "DeleteFile  file not exist " + b)) << logs.Dump();
-
-    ASSERT_TRUE(FileUtil::CreateDirectory(Path("full/inner"), 0775));
-    FileUtil::DeleteFile(Path("full"));
-    EXPECT_TRUE(FileUtil::IsDirectory(Path("full")));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR,
-                              "DeleteFile remove file " + Path("full") + " errno:39, err:Directory not empty"))
-        << logs.Dump();
-}
-
-TEST_F(FileUtilTest, LatestComparesWholeSeconds) {
-    const std::string a = Path("a");
-    const std::string b = Path("b");
-    Write(a, "a");
-    Write(b, "b");
-    auto setTime = [](const std::string& path, time_t sec, long nsec) {
-        struct timespec times[2] = {{sec, nsec}, {sec, nsec}};
-        ASSERT_EQ(0, utimensat(AT_FDCWD, path.c_str(), times, 0));
-    };
-    setTime(a, 1000, 0);
-    setTime(b, 1001, 0);
-    EXPECT_FALSE(FileUtil::IsFileLatest(a, b));
-    EXPECT_TRUE(FileUtil::IsFileLatest(b, a));
-    setTime(a, 1001, 100);
-    setTime(b, 1001, 900000000);  // later within the same second: still equal
-    EXPECT_TRUE(FileUtil::IsFileLatest(a, b));
-    EXPECT_TRUE(FileUtil::IsFileLatest(a, Path("missing")));
-    EXPECT_FALSE(FileUtil::IsFileLatest(Path("missing"), b));
-}
-
-TEST_F(FileUtilTest, DeleteTreeCountsFilesFoldersAndItself) {
-    const std::string top = Path("tree");
-    ASSERT_TRUE(FileUtil::CreateDirectory(top + "/sub/deeper", 0775));
-    ASSERT_TRUE(FileUtil::CreateDirectory(top + "/empty", 0775));
-    Write(top + "/f1", std::string(100, 'x'));
-    Write(top + "/sub/f2", std::string(50, 'y'));
-    Write(top + "/sub/deeper/f3", std::string(7, 'z'));
+    const std::string top = Path("tree"), outside = Path("outside");
+    ASSERT_TRUE(CreateDirectory(top + "/sub/deeper", 0775) && CreateDirectory(top + "/empty", 0775));
+    ASSERT_TRUE(CreateDirectory(outside, 0775) && SaveStringToFile(outside + "/keep", "keep", true));
+    for (const char* f : {"/f1", "/sub/f2", "/sub/deeper/f3"}) {
+        ASSERT_TRUE(SaveStringToFile(top + f, std::string(50, 'x'), true));
+    }
     // A link to a folder outside is removed as a link; what it points to stays.
-    const std::string outside = Path("outside");
-    ASSERT_TRUE(FileUtil::CreateDirectory(outside, 0775));
-    Write(outside + "/keep", "keep");
     ASSERT_EQ(0, symlink(outside.c_str(), (top + "/link").c_str()));
-    struct stat linkStat;
-    ASSERT_EQ(0, lstat((top + "/link").c_str(), &linkStat));
-
-    const uint64_t expected = 100 + 50 + 7 + StatSize(top) + StatSize(top + "/sub") + StatSize(top + "/sub/deeper") +
-                              StatSize(top + "/empty") + linkStat.st_size;
-    uint64_t total = 0;
-    ASSERT_EQ(0, FileUtil::DeleteDirectoryOrFile(top, total, false));
+    uint64_t expected = 150, total = 0;
+    for (const char* p : {"", "/sub", "/sub/deeper", "/empty", "/link"}) {
+        expected += Stat(top + p, false);
+    }
+    DeleteFile(top);  // a single remove, which cannot delete a full folder: the totals below stay whole
+    ASSERT_EQ(0, DeleteDirectoryOrFile(top, total, false));
     EXPECT_EQ(expected, total);
-    EXPECT_TRUE(FileUtil::IsDirectory(top));
-    EXPECT_FALSE(FileUtil::FileExists(top + "/f1"));
-    EXPECT_FALSE(FileUtil::FileExists(top + "/sub"));
-    EXPECT_TRUE(FileUtil::FileExists(outside + "/keep"));
-
-    // The emptied folder itself, counted onto the running total.
+    // Emptied and kept; the folder behind the link untouched.
+    EXPECT_TRUE(IsDirectory(top) && !FileExists(top + "/sub") && FileExists(outside + "/keep"));
+    // The emptied folder itself, added onto the running total.
+    const uint64_t emptied = Stat(top, false);
     total = 10;
-    ASSERT_EQ(0, FileUtil::DeleteDirectoryOrFile(top, total, true));
-    EXPECT_FALSE(FileUtil::FileExists(top));
-    EXPECT_GT(total, 10u);
-
+    ASSERT_EQ(0, DeleteDirectoryOrFile(top, total, true));
+    EXPECT_FALSE(FileExists(top));
+    EXPECT_EQ(10 + emptied, total);
     // A plain file sets the total to its size and goes whatever the flag says.
-    const std::string file = Path("plain");
-    Write(file, std::string(33, 'p'));
-    total = 999;
-    ASSERT_EQ(0, FileUtil::DeleteDirectoryOrFile(file, total, false));
-    EXPECT_EQ(33u, total);
-    EXPECT_FALSE(FileUtil::FileExists(file));
-
-    total = 5;
-    EXPECT_EQ(-1, FileUtil::DeleteDirectoryOrFile(Path("missing"), total, true));
+    ASSERT_TRUE(SaveStringToFile(outside + "/keep", std::string(33, 'p'), true));
+    ASSERT_EQ(0, DeleteDirectoryOrFile(outside + "/keep", total, false));
+    EXPECT_TRUE(total == 33 && !FileExists(outside + "/keep")) << total;
+    EXPECT_EQ(-1, DeleteDirectoryOrFile(Path("missing"), total, true));
 }
 
-}  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

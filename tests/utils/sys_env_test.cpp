@@ -1,115 +1,60 @@
 #include "utils/sys_env.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <spawn.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
-#include <string>
 #include <vector>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
 
-extern char** environ;
-
-namespace android {
-namespace Orvane {
-namespace {
-
-// Set in the environment of the copy of this binary that runs as a second process.
-constexpr const char* kHelperVariable = "ORVANE_SYS_ENV_HELPER";
+namespace android::Orvane {
 
 // The store reads ORVANE_PROPERTY_FILE once, at its first use, so the file is chosen during
-// static initialisation, before any test. The helper process inherits its parent's file.
-class PropertyFile {
-public:
-    PropertyFile() {
-        if (getenv(kHelperVariable) != nullptr) {
-            path_ = getenv("ORVANE_PROPERTY_FILE");
-            return;
-        }
-        char templ[] = "/tmp/orvane_sys_env_XXXXXX";
-        if (mkdtemp(templ) != nullptr) {
-            folder_ = templ;
-            path_ = folder_ + "/build.prop";
-            setenv("ORVANE_PROPERTY_FILE", path_.c_str(), 1);
-        }
+// static initialisation; the helper process (ORVANE_SYS_ENV_HELPER set) inherits its parent's.
+std::string ChooseFile() {
+    static char dir[] = "/tmp/orvane_sys_env_XXXXXX";
+    const bool helper = getenv("ORVANE_SYS_ENV_HELPER") != nullptr;
+    if (!helper && mkdtemp(dir) != nullptr) {
+        setenv("ORVANE_PROPERTY_FILE", (std::string(dir) + "/build.prop").c_str(), 1);
+        atexit([] { system(("rm -rf '" + std::string(dir) + "'").c_str()); });  // also when no test runs
+    } else if (!helper) {
+        setenv("ORVANE_PROPERTY_FILE", "/none/build.prop", 1);  // no usable file: every test fails
     }
-    ~PropertyFile() {
-        if (!folder_.empty()) {
-            std::string cmd = "rm -rf '" + folder_ + "'";
-            if (system(cmd.c_str()) != 0) {
-                fprintf(stderr, "could not remove %s\n", folder_.c_str());
-            }
-        }
-    }
-    const std::string& Path() const { return path_; }
-
-private:
-    std::string folder_;
-    std::string path_;
-};
-
-const PropertyFile gFile;
-
-std::string Get(const std::string& key, const std::string& def = "unset") {
-    return SysEnv::GetSysProperity(key, def);
+    return getenv("ORVANE_PROPERTY_FILE");
 }
+const std::string gPath = ChooseFile();
 
-std::string FileText() {
-    std::string text;
-    FileUtil::LoadStringFromFile(gFile.Path(), text);
-    return text;
-}
+std::string Get(const std::string& key) { return SysEnv::GetSysProperity(key, "unset"); }
 
 class SysEnvTest : public testing::Test {
 protected:
-    void SetUp() override {
-        ASSERT_FALSE(gFile.Path().empty());
-        unlink(gFile.Path().c_str());
-    }
+    void SetUp() override { unlink(gPath.c_str()); }
 };
 
-TEST_F(SysEnvTest, ReadsBuildPropFormatAndWarnsOnceAboutMalformedLines) {
-    ASSERT_TRUE(FileUtil::SaveStringToFile(gFile.Path(),
-                                           "# comment line\n"
-                                           "ro.a=1\n"
-                                           "this line is malformed\n"
-                                           "=novalue\n"
-                                           "  spaced.key = spaced value\n"
-                                           "with.equals=a=b\n"
-                                           "dup=old\n"
-                                           "dup=new\n"
-                                           "empty=\n",
-                                           true));
+TEST_F(SysEnvTest, ReadsBuildPropFormatAndRewritesOnlyTheKey) {
+    ASSERT_TRUE(FileUtil::SaveStringToFile(gPath, "# comment line\nro.a=1\nthis line is malformed\n=novalue\n"
+        "  spaced.key = spaced value\nwith.equals=a=b\ndup=old\ndup=new\nempty=\n", true));
     LogCapture logs;
-    EXPECT_EQ("1", Get("ro.a"));
-    EXPECT_EQ(" spaced value", Get("spaced.key"));
-    EXPECT_EQ("a=b", Get("with.equals"));
-    EXPECT_EQ("new", Get("dup"));
-    EXPECT_EQ("unset", Get("empty"));  // an empty value reads as unset, as on a device
-    EXPECT_EQ("unset", Get("ro.missing"));
-    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "GetSysProperity skipped 2 malformed lines in " + gFile.Path()))
-        << logs.Dump();
-
+    struct { const char* key; const char* value; } cases[] = {{"ro.a", "1"}, {"spaced.key", " spaced value"},
+        {"with.equals", "a=b"}, {"dup", "new"}, {"empty", "unset"} /* empty reads as unset */, {"ro.missing", "unset"}};
+    for (const auto& c : cases) {
+        EXPECT_EQ(c.value, Get(c.key)) << c.key;
+    }
+    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "GetSysProperity skipped 2 malformed lines in " + gPath)) << logs.Dump();
     // A write keeps comments and foreign lines, replaces the key in place and drops its duplicates.
-    ASSERT_TRUE(SysEnv::SetSysProperity("dup", "newest"));
-    ASSERT_TRUE(SysEnv::SetSysProperity("ro.b", "2"));
-    EXPECT_EQ("newest", Get("dup"));
-    EXPECT_EQ("2", Get("ro.b"));
-    std::string text = FileText();
-    EXPECT_NE(std::string::npos, text.find("# comment line\nro.a=1\nthis line is malformed\n")) << text;
-    EXPECT_NE(std::string::npos, text.find("dup=newest\nempty=\nro.b=2\n")) << text;
-    EXPECT_EQ(std::string::npos, text.find("dup=new\n")) << text;
-    // The same bad lines do not warn again.
-    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "malformed")) << logs.Dump();
+    ASSERT_TRUE(SysEnv::SetSysProperity("dup", "newest") && SysEnv::SetSysProperity("ro.b", "2"));
+    std::string text;
+    ASSERT_TRUE(FileUtil::LoadStringFromFile(gPath, text));
+    EXPECT_EQ("# comment line\nro.a=1\nthis line is malformed\n=novalue\n  spaced.key = spaced value\n"
+              "with.equals=a=b\ndup=newest\nempty=\nro.b=2\n", text);
+    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "malformed")) << logs.Dump();  // no second warning
 }
 
-TEST_F(SysEnvTest, ValuesLongerThanTheDeviceLimitAreRefused) {
+TEST_F(SysEnvTest, BadValuesKeysAndUnreadableFilesAreRefused) {
     LogCapture logs;
     const std::string longest(91, 'v');
     ASSERT_TRUE(SysEnv::SetSysProperity("persist.sys.long", longest));
@@ -117,115 +62,69 @@ TEST_F(SysEnvTest, ValuesLongerThanTheDeviceLimitAreRefused) {
     EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity value of persist.sys.long is 92 bytes, at most 91"))
         << logs.Dump();
     EXPECT_EQ(longest, Get("persist.sys.long"));
-
-    EXPECT_FALSE(SysEnv::SetSysProperity("bad key", "1"));
-    EXPECT_FALSE(SysEnv::SetSysProperity("", "1"));
-    EXPECT_FALSE(SysEnv::SetSysProperity("k", "two\nlines"));
+    EXPECT_FALSE(SysEnv::SetSysProperity("bad key", "1") || SysEnv::SetSysProperity("", "1") ||
+                 SysEnv::SetSysProperity("k", "two\nlines"));
     EXPECT_EQ(4u, logs.Count(ANDROID_LOG_ERROR, "SetSysProperity ")) << logs.Dump();
-    EXPECT_EQ(std::string::npos, FileText().find("two")) << FileText();
-}
+    EXPECT_EQ("unset", Get("k"));
 
-TEST_F(SysEnvTest, MissingOrUnreadableFileNeverStopsTheCaller) {
-    EXPECT_EQ("default", Get("ro.any", "default"));
-
-    // A folder where the file should be: it opens, but cannot be read.
-    ASSERT_EQ(0, mkdir(gFile.Path().c_str(), 0755));
-    LogCapture logs;
-    EXPECT_EQ("default", Get("ro.any", "default"));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_WARN, "GetSysProperity cannot read " + gFile.Path())) << logs.Dump();
+    // A folder where the file should be: it opens, but cannot be read; the caller goes on.
+    ASSERT_TRUE(unlink(gPath.c_str()) == 0 && mkdir(gPath.c_str(), 0755) == 0);
+    EXPECT_EQ("unset", Get("persist.sys.long"));
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_WARN, "GetSysProperity cannot read " + gPath)) << logs.Dump();
     EXPECT_FALSE(SysEnv::SetSysProperity("ro.any", "1"));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity cannot read " + gFile.Path())) << logs.Dump();
-    ASSERT_EQ(0, rmdir(gFile.Path().c_str()));
-
-    ASSERT_TRUE(SysEnv::SetSysProperity("ro.any", "1"));
-    EXPECT_EQ("1", Get("ro.any", "default"));
-    unlink(gFile.Path().c_str());
-    EXPECT_EQ("default", Get("ro.any", "default"));
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity cannot read " + gPath)) << logs.Dump();
+    ASSERT_TRUE(rmdir(gPath.c_str()) == 0 && SysEnv::SetSysProperity("ro.any", "1"));
+    EXPECT_EQ("1", Get("ro.any"));
 }
 
-// Runs this binary again as a separate process that executes only SysEnvHelper.ChildProcess.
-int RunHelper() {
-    std::vector<std::string> envStrings;
-    for (char** e = environ; *e != nullptr; ++e) {
-        envStrings.emplace_back(*e);
+constexpr int kKeys = 40;
+std::string Key(int writer, int k) { return "w" + std::to_string(writer) + ".k" + std::to_string(k); }
+bool WriteKeys(int writer) {
+    bool ok = true;
+    for (int k = 0; k < kKeys; ++k) {
+        ok = SysEnv::SetSysProperity(Key(writer, k), std::to_string(k)) && ok;
     }
-    envStrings.push_back(std::string(kHelperVariable) + "=1");
-    std::vector<char*> env;
-    for (auto& s : envStrings) {
-        env.push_back(s.data());
-    }
-    env.push_back(nullptr);
-    std::string self = "/proc/self/exe";
-    std::string filter = "--gtest_filter=SysEnvHelper.ChildProcess";
-    char* argv[] = {self.data(), filter.data(), nullptr};
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
-    pid_t pid;
-    int ret = posix_spawn(&pid, self.c_str(), &actions, nullptr, argv, env.data());
-    posix_spawn_file_actions_destroy(&actions);
-    if (ret != 0) {
-        return -1;
-    }
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    return ok;
 }
 
+// Runs only as a fresh process of this binary (ORVANE_SYS_ENV_HELPER=<writer>).
 TEST(SysEnvHelper, ChildProcess) {
-    if (getenv(kHelperVariable) == nullptr) {
-        GTEST_SKIP() << "runs only as the second process of SysEnvTest.OtherProcessesShareTheFile";
+    const char* writer = getenv("ORVANE_SYS_ENV_HELPER");
+    if (writer == nullptr) {
+        GTEST_SKIP() << "runs only as a child of SysEnvTest.ProcessesShareTheFileAndLoseNoKey";
     }
-    ASSERT_TRUE(SysEnv::SetSysProperity("child.saw", Get("parent.key")));
-    ASSERT_TRUE(SysEnv::SetSysProperity("child.key", "from-child"));
+    ASSERT_TRUE(SysEnv::SetSysProperity("saw" + std::string(writer), Get("parent.key")) && WriteKeys(atoi(writer)));
 }
 
-TEST_F(SysEnvTest, OtherProcessesShareTheFile) {
+TEST_F(SysEnvTest, ProcessesShareTheFileAndLoseNoKey) {
     ASSERT_TRUE(SysEnv::SetSysProperity("parent.key", "from-parent"));
-    EXPECT_EQ("unset", Get("child.key"));  // cached now; the child's write must invalidate it
-    ASSERT_EQ(0, RunHelper());
-    EXPECT_EQ("from-parent", Get("child.saw"));
-    EXPECT_EQ("from-child", Get("child.key"));
-    EXPECT_EQ("from-parent", Get("parent.key"));
-
+    EXPECT_EQ("unset", Get(Key(1, 0)));  // cached now; the children's writes must invalidate it
+    std::vector<pid_t> children;
+    for (int w = 1; w <= 2; ++w) {
+        children.push_back(fork());
+        if (children.back() == 0) {
+            setenv("ORVANE_SYS_ENV_HELPER", std::to_string(w).c_str(), 1);
+            freopen("/dev/null", "w", stdout);
+            execl("/proc/self/exe", "sys_env_test", "--gtest_filter=SysEnvHelper.ChildProcess", nullptr);
+            _exit(127);
+        }
+    }
+    // Writes while the children write.
+    EXPECT_TRUE(WaitUntil([] { return Get(Key(1, 0)) != "unset"; }));
+    EXPECT_TRUE(WriteKeys(0));
+    for (pid_t pid : children) {
+        int status = -1;
+        EXPECT_TRUE(waitpid(pid, &status, 0) == pid && WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    }
+    for (int w = 0; w <= 2; ++w) {
+        EXPECT_EQ(w == 0 ? "unset" : "from-parent", Get("saw" + std::to_string(w)));
+        for (int k = 0; k < kKeys; ++k) {
+            EXPECT_EQ(std::to_string(k), Get(Key(w, k)));
+        }
+    }
     // An edit in place (same file, new size) is seen as well.
-    std::string cmd = "printf 'shell.key=yes\\n' >> '" + gFile.Path() + "'";
-    ASSERT_EQ(0, system(cmd.c_str()));
+    ASSERT_EQ(0, system(("printf 'shell.key=yes\\n' >> '" + gPath + "'").c_str()));
     EXPECT_EQ("yes", Get("shell.key"));
 }
 
-TEST_F(SysEnvTest, ConcurrentWritersLoseNoKey) {
-    constexpr int kWriters = 3;
-    constexpr int kKeys = 40;
-    auto writeAll = [](int writer) {
-        bool ok = true;
-        for (int k = 0; k < kKeys; ++k) {
-            ok = SysEnv::SetSysProperity("w" + std::to_string(writer) + ".k" + std::to_string(k), std::to_string(k)) && ok;
-        }
-        return ok;
-    };
-    std::vector<pid_t> children;
-    for (int w = 1; w < kWriters; ++w) {
-        pid_t pid = fork();
-        ASSERT_GE(pid, 0);
-        if (pid == 0) {
-            _exit(writeAll(w) ? 0 : 1);
-        }
-        children.push_back(pid);
-    }
-    EXPECT_TRUE(writeAll(0));
-    for (pid_t pid : children) {
-        int status = 0;
-        ASSERT_EQ(pid, waitpid(pid, &status, 0));
-        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-    }
-    for (int w = 0; w < kWriters; ++w) {
-        for (int k = 0; k < kKeys; ++k) {
-            EXPECT_EQ(std::to_string(k), Get("w" + std::to_string(w) + ".k" + std::to_string(k))) << w << " " << k;
-        }
-    }
-}
-
-}  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane
