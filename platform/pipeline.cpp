@@ -105,6 +105,11 @@ void Pipeline::RegisterPluginListener(sp<Plugin> listener) {
     listeners_ = std::move(updated);
 }
 
+void Pipeline::ReleaseListeners() {
+    std::lock_guard<std::mutex> lock(listenersLock_);
+    listeners_ = std::make_shared<const ListenerSet>();
+}
+
 std::set<sp<Plugin>> Pipeline::GetListeners() const {
     return *CurrentListeners();
 }

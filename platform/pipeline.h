@@ -34,6 +34,9 @@ public:
     void ProcessEvent(sp<Event> event, unsigned int index);
     // A listener already present is not added again.
     void RegisterPluginListener(sp<Plugin> listener);
+    // Forgets every listener: a source listening to its own pipeline holds it in a cycle that
+    // only the platform's teardown can break.
+    void ReleaseListeners();
 
     const std::string& GetName() const { return name_; }
     const std::vector<sp<Plugin>>& GetPlugins() const { return plugins_; }

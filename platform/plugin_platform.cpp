@@ -71,6 +71,9 @@ PluginPlatform::~PluginPlatform() {
     }
     {
         std::lock_guard<std::mutex> lock(mutex_);
+        for (const auto& pipeline : pipelines_) {
+            pipeline.second->ReleaseListeners();
+        }
         pipelines_.clear();
         plugins_.clear();
         loops_.clear();
