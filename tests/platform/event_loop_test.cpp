@@ -159,10 +159,14 @@ TEST_F(EventLoopTest, LoopReleasedByItsOwnEntryShutsDownCleanly) {
     wp<Event> queued = Queue(new EventHandler(), 30);
     Gate gate;
     Block(gate);
-    loop->AddTask([self = loop]() mutable { self = nullptr; });
+    std::atomic<bool> released{false};
+    loop->AddTask([self = loop, &released]() mutable {
+        self = nullptr;
+        released = true;  // orders the gate's end after its last use, where TSan can see it
+    });
     loop = nullptr;  // the task now holds the only reference
     gate.Open();
-    EXPECT_TRUE(WaitUntil([&] { return queued.promote() == nullptr; }));
+    EXPECT_TRUE(WaitUntil([&] { return released && queued.promote() == nullptr; }));
 }
 
 }  // namespace android::Orvane
