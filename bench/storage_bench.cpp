@@ -14,7 +14,7 @@
 #include <string>
 
 #include "storage/event_database_helper.h"
-#include "tests/storage/fake_plugin_context.h"
+#include "tests/common/fake_plugin_context.h"
 #include "utils/file_util.h"
 
 namespace android {

@@ -2,8 +2,7 @@
 
 #include <mutex>
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 std::mutex gMutex;
@@ -84,5 +83,4 @@ std::string LogCapture::Dump() const {
     return out;
 }
 
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

@@ -7,8 +7,7 @@
 #include <string>
 #include <vector>
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 
 // One line that reached liblog while a LogCapture was alive.
 struct LogLine {
@@ -52,7 +51,6 @@ bool WaitUntil(Predicate done, std::chrono::milliseconds bound = std::chrono::se
     return true;
 }
 
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane
 
 #endif  // ORVANE_TESTS_COMMON_LOG_CAPTURE_H

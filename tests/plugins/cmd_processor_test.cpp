@@ -13,8 +13,7 @@
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 using Clock = std::chrono::steady_clock;
@@ -143,5 +142,4 @@ TEST_F(CmdProcessorTest, FirstLineOfShellOutput) {
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

@@ -12,8 +12,7 @@
 
 #include "tests/common/log_capture.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 
 // orvane-devsim serving a fresh folder, for as long as the object lives.
 class DevSim {
@@ -80,7 +79,6 @@ private:
     pid_t pid = -1;
 };
 
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane
 
 #endif  // ORVANE_TESTS_PLUGINS_DEVSIM_PROCESS_H

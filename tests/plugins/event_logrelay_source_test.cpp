@@ -6,8 +6,7 @@
 #include "plugins/event_radiator.h"
 #include "tests/plugins/event_source_test_util.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 TEST(EventLogrelaySourceTest, RecordsAreForwardedUnchanged) {
@@ -34,14 +33,14 @@ TEST(EventLogrelaySourceTest, MissingOrUnpollableNodeEndsOnlyThisSourceWithOneLi
     // A regular file cannot be watched by epoll, like a node whose driver has no poll support.
     std::string plain = fifo.path + ".plain";
     fclose(fopen(plain.c_str(), "w"));
-    DeviceContext missing{{"qxev", fifo.path}, {"qx_exception_log", fifo.path + ".absent"}};
-    DeviceContext unpollable{{"qx_exception_log", plain}};
+    FakePluginContext missing{"/tmp/", "/tmp/", {{"qxev", fifo.path}, {"qx_exception_log", fifo.path + ".absent"}}};
+    FakePluginContext unpollable{"/tmp/", "/tmp/", {{"qx_exception_log", plain}}};
     // The kernel event source keeps running beside the relay sources that gave up.
     sp<EventRadiator> radiator = new EventRadiator();
     radiator->SetPluginContext(&missing);
     sp<RecordingPlugin> radiated = AttachRecorder(radiator);
     SourceRunner radiatorRunner(radiator);
-    for (DeviceContext* context : {&missing, &unpollable}) {
+    for (FakePluginContext* context : {&missing, &unpollable}) {
         sp<EventLogrelaySource> relay = new EventLogrelaySource();
         relay->SetPluginContext(context);
         SourceRunner relayRunner(relay);
@@ -66,7 +65,7 @@ TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesUnti
     LogCapture logs;
     sp<EventLogrelaySource> relay = new EventLogrelaySource();
     sp<RecordingPlugin> recorder = AttachRecorder(relay);
-    DeviceContext context{{"qx_exception_log", devsim.Path("qx_exception_log")}};
+    FakePluginContext context{"/tmp/", "/tmp/", {{"qx_exception_log", devsim.Path("qx_exception_log")}}};
     relay->SetPluginContext(&context);
     SourceRunner runner(relay);
     ASSERT_TRUE(logs.WaitFor(ANDROID_LOG_DEBUG, "threadLoop LogRelay start loop"));
@@ -90,5 +89,4 @@ TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesUnti
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

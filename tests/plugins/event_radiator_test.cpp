@@ -7,8 +7,7 @@
 #include "platform/plugin_factory.h"
 #include "tests/plugins/event_source_test_util.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 const char* const kInvalid = "ParseEvent event invalid";
@@ -61,7 +60,7 @@ TEST(EventRadiatorTest, RecordsBecomeEventsAndBadOnesAreDroppedWithOneLineEach) 
 
 TEST(EventRadiatorTest, ReadLoopEndsOnAMissingDeviceSplitsAt4096BytesKeepsOrderAndStops) {
     LogCapture logs;
-    DeviceContext missing{{"qxev", "/nonexistent/qxev"}};
+    FakePluginContext missing{"/tmp/", "/tmp/", {{"qxev", "/nonexistent/qxev"}}};
     sp<EventRadiator> lost = new EventRadiator();
     lost->SetPluginContext(&missing);
     lost->StartEventSource();  // returns instead of blocking
@@ -69,7 +68,7 @@ TEST(EventRadiatorTest, ReadLoopEndsOnAMissingDeviceSplitsAt4096BytesKeepsOrderA
     sp<EventRadiator> radiator = new EventRadiator();
     sp<RecordingPlugin> recorder = AttachRecorder(radiator);
     PacketFifo fifo;
-    DeviceContext context{{"qxev", fifo.path}};
+    FakePluginContext context{"/tmp/", "/tmp/", {{"qxev", fifo.path}}};
     radiator->SetPluginContext(&context);
     SourceRunner runner(radiator);
     const std::string prefix = "EventId 901001005 -t 55 -paraList ";
@@ -92,5 +91,4 @@ TEST(EventRadiatorTest, ReadLoopEndsOnAMissingDeviceSplitsAt4096BytesKeepsOrderA
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

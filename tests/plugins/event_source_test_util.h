@@ -1,27 +1,24 @@
 #ifndef ORVANE_TESTS_PLUGINS_EVENT_SOURCE_TEST_UTIL_H
 #define ORVANE_TESTS_PLUGINS_EVENT_SOURCE_TEST_UTIL_H
 
-// Helpers for the tests of the kernel event sources: a plugin that records what reaches it,
-// a context that points the sources at test nodes and a runner for a source's blocking loop.
+// Helpers for the tests of the kernel event sources: a plugin that records what reaches it, a
+// FIFO standing in for a device node and a runner for a source's blocking loop.
 
 #include <pthread.h>
 #include <signal.h>
 #include <sys/stat.h>
 
 #include <atomic>
-#include <initializer_list>
-#include <map>
 #include <mutex>
 #include <thread>
 
 #include "platform/pipeline.h"
 #include "platform/plugin.h"
-#include "platform/plugin_context.h"
+#include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
 #include "tests/plugins/devsim_process.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 
 // The first step of the test pipeline: keeps every event, in arrival order.
 class RecordingPlugin : public Plugin {
@@ -48,34 +45,6 @@ inline sp<RecordingPlugin> AttachRecorder(const sp<EventSource>& source) {
     source->AddPipeline("dftFaultEvent", new Pipeline("dftFaultEvent", {recorder}));
     return recorder;
 }
-
-// A platform that knows nothing but where the device nodes are.
-class DeviceContext : public PluginContext {
-public:
-    DeviceContext(std::initializer_list<std::pair<const std::string, std::string>> devices) : devices(devices) {}
-    std::string GetDevicePath(const std::string& name, const std::string& defaultPath) override {
-        auto found = devices.find(name);
-        return found == devices.end() ? defaultPath : found->second;
-    }
-    bool IsReady() override { return true; }
-    std::string GetWorkDir() override { return "/tmp/"; }
-    std::string GetConfigDir() override { return "/tmp/"; }
-    std::string GetCloudConfigDir() override { return "/tmp/"; }
-    sp<EventLoop> GetSharedWorkLoop() override { return nullptr; }
-    sp<EventLoop> GetLooperByName(const std::string&) override { return nullptr; }
-    std::string GetSysProperity(const std::string&, const std::string& value) override { return value; }
-    bool SetSysProperity(const std::string&, const std::string&) override { return false; }
-    bool PostUnorderedEvent(sp<Event>) override { return false; }
-    void RegisterUnorderedEventListener(sp<EventListener>) override {}
-    bool PostSyncEventToTarget(const std::string&, sp<Event>) override { return false; }
-    bool PostAsyncEventToTarget(const std::string&, sp<Event>) override { return false; }
-    bool InsertEventToPipeline(const std::string&, sp<Event>) override { return false; }
-    bool RegisterPipelineListener(const std::string&, sp<Plugin>) override { return false; }
-    void SetCloudConfigFolder(const std::string&) override {}
-
-private:
-    const std::map<std::string, std::string> devices;
-};
 
 // A FIFO standing in for a device node: written in packet mode, one write is one read, and a
 // write longer than 4096 bytes arrives as several reads of at most 4096 bytes.
@@ -135,7 +104,6 @@ private:
     std::thread thread;
 };
 
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane
 
 #endif  // ORVANE_TESTS_PLUGINS_EVENT_SOURCE_TEST_UTIL_H

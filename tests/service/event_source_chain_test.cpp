@@ -18,8 +18,7 @@
 #include "tests/common/log_capture.h"
 #include "tests/plugins/devsim_process.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 // event_info rows of an id: "first_time|occured_cnt|param_list" each, by row id.
@@ -155,5 +154,4 @@ TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

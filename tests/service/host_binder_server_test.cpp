@@ -14,8 +14,7 @@
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 // Records the arguments that the shared transaction code hands to the methods.
@@ -237,5 +236,4 @@ TEST_F(HostBinderServerTest, ClientThatNeverReadsItsRepliesIsDropped) {
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

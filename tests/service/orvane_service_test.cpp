@@ -19,8 +19,7 @@
 #include "utils/file_util.h"
 #include "utils/sys_env.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 constexpr uid_t kSystemUid = 1000;
@@ -261,5 +260,4 @@ TEST_F(OrvaneServiceTest, StartServiceServesWithCheckSwitchedOff) {
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

@@ -4,7 +4,7 @@
 
 #include "storage/event_table.h"
 #include "tests/common/log_capture.h"
-#include "tests/storage/fake_plugin_context.h"
+#include "tests/common/fake_plugin_context.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/time_util.h"
 

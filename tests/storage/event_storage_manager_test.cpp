@@ -6,7 +6,7 @@
 
 #include "platform/plugin_factory.h"
 #include "tests/common/log_capture.h"
-#include "tests/storage/fake_plugin_context.h"
+#include "tests/common/fake_plugin_context.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 

@@ -3,16 +3,14 @@
 #include <gtest/gtest.h>
 
 #include <poll.h>
-#include <sys/epoll.h>
+#include <signal.h>
 
 #include <algorithm>
-#include <atomic>
 #include <thread>
 
 #include "tests/plugins/devsim_process.h"
 
-namespace android {
-namespace Orvane {
+namespace android::Orvane {
 namespace {
 
 class DevSimTest : public ::testing::Test {
@@ -65,58 +63,16 @@ TEST_F(DevSimTest, OneRecordPerReadAndAFullQueueLosesNothing) {
     }
     writer.join();
     EXPECT_EQ(0, Ready(reader, 0));
-    close(reader);
-}
-
-TEST_F(DevSimTest, HeldReadWakesOnWriteAndOnSignal) {
-    int fd = Open("qxev", O_RDWR);
-    ASSERT_GE(fd, 0);
-    // A reader and a writer on one descriptor do not block each other.
-    std::string received;
-    std::atomic<pid_t> readerTid{0};
-    std::thread reader([&] {
-        readerTid = gettid();
-        received = ReadRecord(fd);
-    });
-    ASSERT_TRUE(WaitUntil([&] {  // the reader sleeps in the kernel: its read is held
-        int stat = open(("/proc/self/task/" + std::to_string(readerTid) + "/stat").c_str(), O_RDONLY | O_CLOEXEC);
-        bool sleeping = readerTid != 0 && ReadRecord(stat, 64).find(") S ") != std::string::npos;
-        return close(stat) == 0 && sleeping;
-    }));
-    const std::string record = "written on the reader's own descriptor";
-    ASSERT_EQ(static_cast<ssize_t>(record.size()), write(fd, record.data(), record.size()));
-    reader.join();
-    EXPECT_EQ(record, received);
-    // An interrupted read fails with EINTR and takes no record with it.
+    // A held read that is interrupted fails with EINTR and takes no record with it.
     struct sigaction action = {};
     action.sa_handler = [](int) {};  // no SA_RESTART
     sigaction(SIGALRM, &action, nullptr);
     alarm(1);
-    EXPECT_EQ("", ReadRecord(fd));
+    EXPECT_EQ("", ReadRecord(reader));
     EXPECT_EQ(EINTR, errno);
     ASSERT_TRUE(devsim.Inject("qxev", "after the interrupt"));
-    EXPECT_EQ("after the interrupt", ReadRecord(fd));
-    close(fd);
-}
-
-TEST_F(DevSimTest, ExceptionLogSignalsPriorityDataUntilTheRecordIsRead) {
-    int fd = Open("qx_exception_log", O_RDONLY);
-    ASSERT_GE(fd, 0);
-    int epfd = epoll_create(64);
-    struct epoll_event watch = {}, ready[4];
-    watch.events = EPOLLPRI;
-    ASSERT_EQ(0, epoll_ctl(epfd, EPOLL_CTL_ADD, fd, &watch));
-    EXPECT_EQ(0, epoll_wait(epfd, ready, 4, 0));
-    std::thread writer([&] { devsim.Inject("qx_exception_log", std::string(1500, 'e')); });
-    ASSERT_EQ(1, epoll_wait(epfd, ready, 4, 10000));  // wakes a waiter already blocked
-    EXPECT_TRUE(ready[0].events & EPOLLPRI);
-    writer.join();
-    EXPECT_EQ(1023u, ReadRecord(fd, 1023).size());
-    ASSERT_EQ(1, epoll_wait(epfd, ready, 4, 10000));  // still pending: the rest of the record
-    EXPECT_EQ(477u, ReadRecord(fd, 1023).size());
-    EXPECT_EQ(0, epoll_wait(epfd, ready, 4, 0));
-    close(epfd);
-    close(fd);
+    EXPECT_EQ("after the interrupt", ReadRecord(reader));
+    close(reader);
 }
 
 TEST(DevSimMountTest, UnmountableFolderIsReportedInOneLine) {
@@ -128,5 +84,4 @@ TEST(DevSimMountTest, UnmountableFolderIsReportedInOneLine) {
 }
 
 }  // namespace
-}  // namespace Orvane
-}  // namespace android
+}  // namespace android::Orvane

@@ -1,5 +1,5 @@
-#ifndef ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
-#define ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
+#ifndef ORVANE_TESTS_COMMON_FAKE_PLUGIN_CONTEXT_H
+#define ORVANE_TESTS_COMMON_FAKE_PLUGIN_CONTEXT_H
 
 #include <map>
 #include <mutex>
@@ -9,12 +9,13 @@
 
 namespace android::Orvane {
 
-// A platform stand-in for the storage tests: fixed folders, properties in a map, a real shared
-// work loop, and a record of the events inserted into pipelines. Any thread may call it.
+// A platform stand-in: fixed folders and device nodes, properties in a map, a real shared work
+// loop, and a record of the events inserted into pipelines. Any thread may call it.
 class FakePluginContext : public PluginContext {
 public:
-    FakePluginContext(const std::string& workDir, const std::string& configDir)
-        : workDir_(workDir), configDir_(configDir), sharedLoop_(new EventLoop("plat_shared")) {
+    FakePluginContext(const std::string& workDir, const std::string& configDir,
+                      std::map<std::string, std::string> devices = {})
+        : workDir_(workDir), configDir_(configDir), devices_(std::move(devices)), sharedLoop_(new EventLoop("plat_shared")) {
         sharedLoop_->StartLoop();
     }
     ~FakePluginContext() override { sharedLoop_->StopLoop(); }
@@ -38,7 +39,10 @@ public:
         properties_[key] = value;
         return true;
     }
-    std::string GetDevicePath(const std::string&, const std::string& defaultPath) override { return defaultPath; }
+    std::string GetDevicePath(const std::string& name, const std::string& defaultPath) override {
+        auto found = devices_.find(name);
+        return found == devices_.end() ? defaultPath : found->second;
+    }
     bool PostUnorderedEvent(sp<Event>) override { return true; }
     void RegisterUnorderedEventListener(sp<EventListener>) override {}
     bool PostSyncEventToTarget(const std::string&, sp<Event>) override { return false; }
@@ -51,7 +55,8 @@ public:
     bool RegisterPipelineListener(const std::string&, sp<Plugin>) override { return false; }
     void SetCloudConfigFolder(const std::string&) override {}
 
-    std::string workDir_, configDir_;
+    const std::string workDir_, configDir_;
+    const std::map<std::string, std::string> devices_;
     sp<EventLoop> sharedLoop_;
     std::mutex mutex_;
     std::map<std::string, std::string> properties_;
@@ -60,4 +65,4 @@ public:
 
 }  // namespace android::Orvane
 
-#endif  // ORVANE_TESTS_STORAGE_FAKE_PLUGIN_CONTEXT_H
+#endif  // ORVANE_TESTS_COMMON_FAKE_PLUGIN_CONTEXT_H
