@@ -51,6 +51,12 @@ void EventRadiator::StartEventSource() {
         }
         return;
     }
+    // select cannot watch a descriptor beyond its fixed set; FD_SET would write past it.
+    if (fd >= FD_SETSIZE) {
+        OLOGE("%s descriptor %d beyond select's reach", fd);
+        close(fd);
+        return;
+    }
     char buffer[kMaxRecord + 1] = {};
     while (!stopping) {
         fd_set readable;

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/resource.h>
+
 #include <cstdint>
 
 #include "platform/plugin_factory.h"
@@ -65,9 +67,23 @@ TEST(EventRadiatorTest, ReadLoopEndsOnAMissingDeviceSplitsAt4096BytesKeepsOrderA
     lost->SetPluginContext(&missing);
     lost->StartEventSource();  // returns instead of blocking
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR, "StartEventSource open log exception failed")) << logs.Dump();
+    PacketFifo fifo;
+    struct rlimit files = {};
+    getrlimit(RLIMIT_NOFILE, &files);
+    files.rlim_cur = files.rlim_max;
+    if (setrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur > FD_SETSIZE + 16) {
+        // With every descriptor select can watch taken, the node's is refused rather than overrun.
+        std::vector<int> taken;
+        for (int fd = 0; fd >= 0 && fd < FD_SETSIZE;) taken.push_back(fd = dup(STDERR_FILENO));
+        FakePluginContext crowded{"/tmp/", "/tmp/", {{"qxev", fifo.path}}};
+        sp<EventRadiator> late = new EventRadiator();
+        late->SetPluginContext(&crowded);
+        late->StartEventSource();
+        for (int fd : taken) close(fd);
+        EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "StartEventSource descriptor ")) << logs.Dump();
+    }
     sp<EventRadiator> radiator = new EventRadiator();
     sp<RecordingPlugin> recorder = AttachRecorder(radiator);
-    PacketFifo fifo;
     FakePluginContext context{"/tmp/", "/tmp/", {{"qxev", fifo.path}}};
     radiator->SetPluginContext(&context);
     SourceRunner runner(radiator);
