@@ -1,6 +1,5 @@
 // Runs the daemon binary as processes: one instance per work folder, and a restart after the
 // running one was killed.
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <spawn.h>
@@ -16,12 +15,10 @@ extern char** environ;
 
 namespace android::Orvane {
 
-const std::string kBinary = ORVANE_BINARY_DIR "/orvane";
-
 class OrvaneDaemonTest : public testing::Test {
 protected:
     void SetUp() override {
-        ASSERT_EQ(access(kBinary.c_str(), X_OK), 0) << kBinary << " is not built";
+        ASSERT_EQ(access(ORVANE_BINARY_DIR "/orvane", X_OK), 0) << "the daemon is not built";
         char pattern[] = "/tmp/orvane_daemon_test_XXXXXX";
         ASSERT_NE(mkdtemp(pattern), nullptr);
         root_ = pattern;
@@ -30,33 +27,19 @@ protected:
     }
     void TearDown() override {
         for (pid_t pid : started_) {
-            if (waitpid(pid, nullptr, WNOHANG) == 0) {  // still ours and running
-                kill(pid, SIGKILL);
-                waitpid(pid, nullptr, 0);
-            }
+            if (waitpid(pid, nullptr, WNOHANG) == 0 && kill(pid, SIGKILL) == 0) waitpid(pid, nullptr, 0);  // still ours
         }
         system(("rm -rf " + root_).c_str());
     }
 
-    // Starts the daemon with `args` before the test folders, its standard error going to `<name>.log`.
-    pid_t Start(const std::string& name, std::vector<std::string> args = {}) {
-        args.insert(args.begin(), kBinary);
-        args.insert(args.end(), {"-configDir", root_ + "/etc", "-workDir", root_ + "/work", "-cloudCfgDir",
-                                 root_ + "/cloud", "-region", "CN"});
-        std::vector<char*> argv;
-        for (auto& arg : args) {
-            argv.push_back(&arg[0]);
-        }
-        argv.push_back(nullptr);
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
-        posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, (root_ + "/" + name + ".log").c_str(),
-                                         O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    // Starts the daemon on the test folders, its standard error going to `<name>.log`.
+    pid_t Start(const std::string& name) {
+        const std::string command = "cd " + root_ + " && exec " ORVANE_BINARY_DIR "/orvane -configDir $PWD/etc " +
+                                    "-workDir $PWD/work -cloudCfgDir $PWD/cloud -region CN 2>" + name + ".log";
+        const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
         pid_t pid = -1;
-        EXPECT_EQ(posix_spawn(&pid, kBinary.c_str(), &actions, nullptr, argv.data(), environ), 0);
-        posix_spawn_file_actions_destroy(&actions);
-        started_.push_back(pid);
-        return pid;
+        EXPECT_EQ(posix_spawn(&pid, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
+        return started_.emplace_back(pid);
     }
     std::string Log(const std::string& name) {
         std::ifstream file(root_ + "/" + name + ".log");

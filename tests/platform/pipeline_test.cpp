@@ -1,50 +1,36 @@
 #include "platform/pipeline.h"
 
-#include <atomic>
-
 #include "tests/platform/platform_test_util.h"
 
 namespace android::Orvane {
 
-// Records its step and returns a fixed result; a gate, when set, holds it while it runs.
-class StepPlugin : public Plugin {
-public:
+// Records its step and returns a fixed result.
+struct StepPlugin : Plugin {
     StepPlugin(const std::string& name, Journal& journal, EVENT_RET result = 0, bool accepts = true)
-        : journal_(journal), result_(result), accepts_(accepts) {
-        SetName(name);
-    }
+        : journal(journal), result(result), accepts(accepts) { SetName(name); }
     EVENT_RET OnEvent(sp<Event>&) override {
-        if (gate != nullptr) {
-            started = true;
-            gate->Wait();
-        }
-        journal_.Add(GetName());
-        return result_;
+        journal.Add(GetName());
+        return result;
     }
-    bool CanProcessEvent(sp<Event>) override { return accepts_; }
+    bool CanProcessEvent(sp<Event>) override { return accepts; }
 
-    Gate* gate = nullptr;
-    std::atomic<bool> started{false};
-
-private:
-    Journal& journal_;
-    const EVENT_RET result_;
-    const bool accepts_;
+    Journal& journal;
+    const EVENT_RET result;
+    const bool accepts;
 };
 
 TEST(PipelineTest, FirstAcceptingPipelineTakesTheEvent) {
-    Journal journal;
+    Journal log;
     sp<EventSource> source = new EventSource();
     source->AddPipeline("missing", nullptr);
     source->AddPipeline("empty", new Pipeline("empty", {}));
-    source->AddPipeline("refusing", new Pipeline("refusing", {new StepPlugin("R", journal, 0, false)}));
+    source->AddPipeline("refusing", new Pipeline("refusing", {new StepPlugin("R", log, 0, false)}));
     EXPECT_FALSE(source->PublishPipelineEvent(new Event("test")));
-    source->AddPipeline("first", new Pipeline("first", {new StepPlugin("F1", journal), nullptr,
-                                                        new StepPlugin("F2", journal)}));
-    source->AddPipeline("second", new Pipeline("second", {new StepPlugin("S", journal)}));
+    source->AddPipeline("1st", new Pipeline("1st", {new StepPlugin("F1", log), nullptr, new StepPlugin("F2", log)}));
+    source->AddPipeline("second", new Pipeline("second", {new StepPlugin("S", log)}));
     // No plugin has a loop: the whole pipeline ran on this thread before Publish returned.
     EXPECT_TRUE(source->PublishPipelineEvent(new Event("test")));
-    EXPECT_EQ(journal.Entries(), std::vector<std::string>({"F1", "F2"}));
+    EXPECT_EQ(log.Entries(), std::vector<std::string>({"F1", "F2"}));
 }
 
 TEST(PipelineTest, ResultsStopThePipelineAndDecideOnListeners) {
@@ -61,11 +47,9 @@ TEST(PipelineTest, ResultsStopThePipelineAndDecideOnListeners) {
     };
     for (const auto& c : cases) {
         Journal journal;
-        std::vector<sp<Plugin>> plugins;
-        for (size_t i = 0; i < c.results.size(); i++) {
-            plugins.push_back(new StepPlugin("P" + std::to_string(i), journal, c.results[i]));
-        }
-        sp<Pipeline> pipeline = new Pipeline("results", plugins);
+        sp<Pipeline> pipeline = new Pipeline("results", {new StepPlugin("P0", journal, c.results[0]),
+                                                         new StepPlugin("P1", journal, c.results[1]),
+                                                         new StepPlugin("P2", journal, c.results[2])});
         sp<Plugin> listener = new StepPlugin("L", journal);
         pipeline->RegisterPluginListener(listener);
         pipeline->RegisterPluginListener(listener);  // told once
@@ -79,20 +63,15 @@ TEST(PipelineTest, SameLoopStepsRunInOneTaskOtherStepsAndListenersOnTheirLoops) 
     sp<EventLoop> loops[] = {new EventLoop("same_loop"), new EventLoop("next_loop"), new EventLoop("listen_loop")};
     sp<StepPlugin> steps[] = {new StepPlugin("A", journal), new StepPlugin("B", journal), new StepPlugin("C", journal),
                               new StepPlugin("LoopListener", journal)};
-    for (const auto& loop : loops) {
-        loop->StartLoop();
-    }
-    for (int i = 0; i < 4; i++) {
-        steps[i]->SetLooper(loops[i < 2 ? 0 : i - 1]);
-    }
+    for (const auto& loop : loops) loop->StartLoop();
+    for (int i = 0; i < 4; i++) steps[i]->SetLooper(loops[i < 2 ? 0 : i - 1]);
     sp<Pipeline> pipeline = new Pipeline("same", {steps[0], steps[1], steps[2]});
     pipeline->RegisterPluginListener(steps[3]);
     pipeline->RegisterPluginListener(new StepPlugin("DirectListener", journal));
     Gate gate;
-    steps[0]->gate = &gate;
+    loops[0]->AddTask([&gate] { gate.Wait(); }, 0, false);
     pipeline->ProcessPipeline(new Event("test"), 0);
-    ASSERT_TRUE(WaitUntil([&] { return steps[0]->started.load(); }));
-    // Queued while A runs: B posted as a task of its own would run after it.
+    // Queued right behind A: B posted as a task of its own would run after it.
     loops[0]->AddTask([&journal] { journal.Add("T"); }, 0, false);
     gate.Open();
     ASSERT_TRUE(journal.WaitForSize(6));

@@ -16,19 +16,10 @@ namespace android::Orvane {
 // What ran, in order, on which thread and when. Safe from any thread.
 class Journal {
 public:
-    struct Record {
-        std::string what;
-        std::thread::id thread;
-        std::chrono::steady_clock::time_point when;
-    };
-
+    struct Record { std::string what; std::thread::id thread; std::chrono::steady_clock::time_point when; };
     void Add(const std::string& what) {
         std::lock_guard<std::mutex> lock(mutex_);
         records_.push_back({what, std::this_thread::get_id(), std::chrono::steady_clock::now()});
-    }
-    void Clear() {
-        std::lock_guard<std::mutex> lock(mutex_);
-        records_.clear();
     }
     std::vector<Record> Records() {
         std::lock_guard<std::mutex> lock(mutex_);
@@ -36,9 +27,7 @@ public:
     }
     std::vector<std::string> Entries() {
         std::vector<std::string> entries;
-        for (const auto& record : Records()) {
-            entries.push_back(record.what);
-        }
+        for (const auto& record : Records()) entries.push_back(record.what);
         return entries;
     }
     // The first record of `what`; one with an empty `what` when there is none.
@@ -47,12 +36,8 @@ public:
         auto it = std::find_if(records.begin(), records.end(), [&](const Record& r) { return r.what == what; });
         return it == records.end() ? Record() : *it;
     }
-    bool WaitFor(const std::string& what) {
-        return WaitUntil([&] { return !Find(what).what.empty(); });
-    }
-    bool WaitForSize(size_t size) {
-        return WaitUntil([&] { return Records().size() >= size; });
-    }
+    bool WaitFor(const std::string& what) { return WaitUntil([&] { return !Find(what).what.empty(); }); }
+    bool WaitForSize(size_t size) { return WaitUntil([&] { return Records().size() >= size; }); }
 
 private:
     std::mutex mutex_;

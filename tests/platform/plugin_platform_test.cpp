@@ -12,45 +12,34 @@
 namespace android::Orvane {
 
 // What the test plugins did, shared with the tests (the factory builds the plugins itself).
-Journal& Plugins() {
-    static Journal journal;
-    return journal;
-}
+Journal gPlugins;
 
-// Records its load and every event.
-class PlatTestProcessor : public Plugin {
+// Records its load and every event; listens for unordered events of type 1, id 0 from its load on.
+class PlatTestProcessor : public Plugin, public EventListener {
 public:
-    void OnLoad() override { Plugins().Add("OnLoad:" + GetName()); }
+    void OnLoad() override {
+        gPlugins.Add("OnLoad:" + GetName());
+        AddListenerInfo(1, 0);
+        GetPluginContext()->RegisterUnorderedEventListener(this);
+    }
     EVENT_RET OnEvent(sp<Event>& event) override {
-        Plugins().Add(GetName() + ":" + std::to_string(event->eventId));
+        gPlugins.Add(GetName() + ":" + std::to_string(event->eventId));
         return 0;
     }
+    void OnUnorderedEvent(sp<Event> event) override { gPlugins.Add("Unordered:" + event->sender); }
 };
 ORVANE_REGISTER_PLUGIN(PlatTestProcessor);
-class PlatTestSink : public PlatTestProcessor {};
-ORVANE_REGISTER_PLUGIN(PlatTestSink);
 class PlatTestDelayed : public PlatTestProcessor {};
 ORVANE_REGISTER_PLUGIN(PlatTestDelayed);
 
 // Publishes an event as soon as it is started.
 class PlatTestSource : public EventSource {
     void StartEventSource() override {
-        Plugins().Add("Start:" + GetName());
+        gPlugins.Add("Start:" + GetName());
         PublishPipelineEvent(new Event(GetName()));
     }
 };
 ORVANE_REGISTER_PLUGIN(PlatTestSource);
-
-// Listens for unordered events of type 1, id 0 from its load on.
-class PlatTestListener : public PlatTestProcessor, public EventListener {
-    void OnLoad() override {
-        PlatTestProcessor::OnLoad();
-        AddListenerInfo(1, 0);
-        GetPluginContext()->RegisterUnorderedEventListener(this);
-    }
-    void OnUnorderedEvent(sp<Event> event) override { Plugins().Add("Unordered:" + event->sender); }
-};
-ORVANE_REGISTER_PLUGIN(PlatTestListener);
 
 class PluginPlatformTest : public testing::Test {
 protected:
@@ -59,16 +48,8 @@ protected:
     void SetUp() override {
         char pattern[] = "/tmp/plugin_platform_test_XXXXXX";
         ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
-        etc_ = root_ + "/etc/";
-        cloud_ = root_ + "/cloud/";
+        root_ = pattern, etc_ = root_ + "/etc/", cloud_ = root_ + "/cloud/";
         ASSERT_EQ(system(("mkdir -p " + etc_ + " " + cloud_).c_str()), 0);
-        Plugins().Clear();
-        TearDown();
-    }
-    void TearDown() override {
-        SysEnv::SetSysProperity("ro.quor.build.region", "");
-        SysEnv::SetSysProperity("ro.quor.build.type", "0");
     }
     ~PluginPlatformTest() override { system(("rm -rf " + root_).c_str()); }
 
@@ -76,9 +57,7 @@ protected:
     std::unique_ptr<PluginPlatform> NewPlatform(std::vector<std::string> args = {}) {
         args.insert(args.begin(), {"orvane", "-configDir", etc_, "-workDir", root_ + "/work", "-cloudCfgDir", cloud_});
         std::vector<char*> argv;
-        for (auto& arg : args) {
-            argv.push_back(&arg[0]);
-        }
+        for (auto& arg : args) argv.push_back(&arg[0]);
         auto platform = std::make_unique<PluginPlatform>();
         EXPECT_EQ(platform->ParseArgs(static_cast<int>(argv.size()), argv.data()), 0);
         return platform;
@@ -121,55 +100,43 @@ TEST_F(PluginPlatformTest, ConfigFileFollowsCloudCopiesRegionAndBuildType) {
     EXPECT_EQ(eu->GetPluginConfigPath(), global);
     Write(cloudGlobal, "plugins:0\n");
     EXPECT_EQ(eu->GetPluginConfigPath(), cloudGlobal);
-    unlink(global.c_str());
-    unlink(cloudGlobal.c_str());
-    EXPECT_EQ(eu->GetPluginConfigPath(), cloudNamed);
     // Without a region on the command line the system property decides.
-    Write(global, "plugins:0\n");
     auto unset = NewPlatform();
     SysEnv::SetSysProperity("ro.quor.build.region", "cn");
     EXPECT_EQ(unset->GetPluginConfigPath(), cloudNamed);
     SysEnv::SetSysProperity("ro.quor.build.region", "");
-    EXPECT_EQ(unset->GetPluginConfigPath(), global);
+    EXPECT_EQ(unset->GetPluginConfigPath(), cloudGlobal);
     // Domestic region on an export build: the global file unless the folder marks compatibility.
     unlink(cloudNamed.c_str());
     SysEnv::SetSysProperity("ro.quor.build.type", "2");
-    EXPECT_EQ(cn->GetPluginConfigPath(), global);
+    EXPECT_EQ(cn->GetPluginConfigPath(), cloudGlobal);
     Write(etc_ + "compatible", "");
     EXPECT_EQ(cn->GetPluginConfigPath(), named);
+    SysEnv::SetSysProperity("ro.quor.build.type", "0");
 }
 
 TEST_F(PluginPlatformTest, StartsPluginsSourcesAndDelayedPlugins) {
     Write(etc_ + "plugin_config",
-          "plugins:5\n"
-          "PlatTestSource[thread:src_loop]:0 static\n"
-          "PlatTestProcessor[thread:proc_loop]:0 static\n"
-          "PlatTestSink[thread:proc_loop]:0 static\n"
-          "PlatTestListener[]:0 static\n"
+          "plugins:3\nPlatTestSource[thread:src_loop]:0 static\nPlatTestProcessor[thread:proc_loop]:0 static\n"
           "PlatTestDelayed[thread:late_loop]:1 static\n"
-          "pipelines:1\n"
-          "main: PlatTestProcessor PlatTestSink\n"
-          "pipelinetriggers:1\n"
-          "PlatTestSource: main\n");
+          "pipelines:1\nmain: PlatTestProcessor\npipelinetriggers:1\nPlatTestSource: main\n");
     auto platform = NewPlatform({"-region", "CN"});
     auto start = std::chrono::steady_clock::now();
     ASSERT_TRUE(platform->StartPlatform());
-    EXPECT_EQ(platform->GetPlugins().size(), 4u);  // the delayed one is not there yet
-    std::thread::id procThread = ThreadOfLoop(platform->GetLooperByName("proc_loop"));
 
     // The source, loaded first, started on its loop only once every plugin was loaded; its
     // event went through the pipeline on the plugins' loop.
-    ASSERT_TRUE(Plugins().WaitFor("PlatTestSink:0"));
-    Journal::Record started = Plugins().Find("Start:PlatTestSource");
+    ASSERT_TRUE(gPlugins.WaitFor("PlatTestProcessor:0"));
+    Journal::Record started = gPlugins.Find("Start:PlatTestSource");
     EXPECT_EQ(started.thread, ThreadOfLoop(platform->GetLooperByName("src_loop")));
-    EXPECT_GE(started.when, Plugins().Find("OnLoad:PlatTestListener").when);
-    EXPECT_EQ(Plugins().Find("PlatTestProcessor:0").thread, procThread);
+    EXPECT_GE(started.when, gPlugins.Find("OnLoad:PlatTestProcessor").when);
+    EXPECT_EQ(gPlugins.Find("PlatTestProcessor:0").thread, ThreadOfLoop(platform->GetLooperByName("proc_loop")));
     // The ready event reached the listener registered during loading.
-    EXPECT_TRUE(Plugins().WaitFor("Unordered:platform"));
+    EXPECT_TRUE(gPlugins.WaitFor("Unordered:platform"));
 
     // The delayed plugin is constructed on the work loop after its delay, bound and loaded.
-    ASSERT_TRUE(Plugins().WaitFor("OnLoad:PlatTestDelayed"));
-    Journal::Record delayed = Plugins().Find("OnLoad:PlatTestDelayed");
+    ASSERT_TRUE(gPlugins.WaitFor("OnLoad:PlatTestDelayed"));
+    Journal::Record delayed = gPlugins.Find("OnLoad:PlatTestDelayed");
     EXPECT_GE(delayed.when - start, std::chrono::milliseconds(900));
     EXPECT_EQ(delayed.thread, ThreadOfLoop(platform->GetSharedWorkLoop()));
     EXPECT_EQ(platform->GetPlugins()["PlatTestDelayed"]->GetLooper()->GetName(), "late_loop");

@@ -15,14 +15,7 @@ void SetZone(const char* zone) {
 
 constexpr int64_t kSample = 1709622489;  // 2024-03-05 07:08:09 UTC
 
-TEST(TimeUtilTest, DatesMidnightsInSeveralZonesAndClocks) {
-    SetZone("UTC0");
-    EXPECT_EQ("2024-03-05 07:08:09", TimeUtil::GetTimeDateStr(kSample, "%Y-%m-%d %H:%M:%S"));
-    // 20 characters do not fit the 20-byte buffer with its terminator.
-    EXPECT_EQ("", TimeUtil::GetTimeDateStr(kSample, "%Y-%m-%d %H:%M:%S!") + TimeUtil::GetTimeDateStr(kSample, ""));
-    SetZone("CST-8");
-    EXPECT_EQ("20240305150809", TimeUtil::GetTimeDateStr(kSample, "%Y%m%d%H%M%S"));
-
+TEST(TimeUtilTest, MidnightsInSeveralZonesAndClockUnits) {
     // POSIX TZ strings name the offset west; `east` is seconds east of UTC.
     struct { const char* tz; int64_t east; } zones[] = {
         {"UTC0", 0}, {"CST-8", 8 * 3600}, {"EST5", -5 * 3600}, {"<+1345>-13:45", 49500}, {"<-11>11", -11 * 3600}};
@@ -41,16 +34,9 @@ TEST(TimeUtilTest, DatesMidnightsInSeveralZonesAndClocks) {
     EXPECT_EQ(1711839600, TimeUtil::GetZeroTimestampSec(1711879200));
     EXPECT_EQ(1729980000, TimeUtil::GetZeroTimestampSec(1730026800));
 
-    int64_t before = TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(TimeUtil::GetTimestampSecond()));
-    int64_t ms = TimeUtil::GetZeroTimestampMs();
-    int64_t after = TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(TimeUtil::GetTimestampSecond()));
-    EXPECT_TRUE(ms == before * 1000 || ms == after * 1000) << ms;
-
     // The clocks agree on their units.
     const uint64_t us = TimeUtil::GetTimestampUS(), s = TimeUtil::GetTimestampSecond();
     EXPECT_TRUE(us > 1600000000ull * 1000000 && s >= us / 1000000 && s <= us / 1000000 + 5) << us << " " << s;
-    const int64_t a = TimeUtil::GetNanoSecondSinceSystemStart();
-    EXPECT_TRUE(a > 0 && TimeUtil::GetNanoSecondSinceSystemStart() >= a) << a;
 }
 
 }  // namespace android::Orvane
