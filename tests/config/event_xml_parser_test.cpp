@@ -9,6 +9,7 @@
 #include <random>
 #include <regex>
 #include <thread>
+#include <tuple>
 
 namespace android::Orvane {
 namespace {
@@ -68,7 +69,16 @@ TEST_F(EventXmlParserTest, EntryAttributesAndExtend) {
     std::string entries;
     for (uint32_t i = 0; i < 4; ++i)
         entries += Entry(910000001 + i, cases[i].first, 0);
-    Write(entries);
+    Write(entries + "  <Event id=\"910000009\">\n"
+                    "    <Param id=\"1\" name=\"pkg\" type=\"string\" len=\"64\" PrivacyLevel=\"L1\" defVal=\"0\"/>\n"
+                    "    <Param id=\"2\" name=\"info\" type=\"class\" classID=\"901001002\" arrLen=\"8\"/>\n"
+                    "    <Param id=\"3\" name=\"ratio\" type=\"double\" PrivacyLevel=\"L9\"/>\n  </Event>\n");
+    sp<EventInfoConfig> withParams = Get(910000009);
+    ASSERT_TRUE(withParams != nullptr && withParams->params.size() == 3u);
+    const std::vector<EventParamInfoCfg>& p = withParams->params;
+    EXPECT_EQ(std::make_tuple(p[0].name, p[0].type, p[0].len, p[0].privacyLevel, p[0].defVal, p[1].type, p[1].classID,
+                              p[1].arrLen, p[2].type, p[2].privacyLevel),
+              std::make_tuple(std::string("pkg"), 1u, 64u, 1u, std::string("0"), 7u, 901001002u, 8u, 0u, 5u));
     EXPECT_EQ(Get(91000000), nullptr);  // a prefix of a catalogued id does not match it
     for (uint32_t i = 0; i < 4; ++i) {
         sp<EventInfoConfig> e = Get(910000001 + i);
