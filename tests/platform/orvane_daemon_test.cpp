@@ -7,9 +7,9 @@
 #include <unistd.h>
 
 #include <fstream>
-#include <iterator>
 
 #include "tests/common/log_capture.h"
+#include "utils/file_util.h"
 
 extern char** environ;
 
@@ -42,8 +42,9 @@ protected:
         return started_.emplace_back(pid);
     }
     std::string Log(const std::string& name) {
-        std::ifstream file(root_ + "/" + name + ".log");
-        return std::string(std::istreambuf_iterator<char>(file), {});
+        std::string text;
+        FileUtil::LoadStringFromFile(root_ + "/" + name + ".log", text);
+        return text;
     }
     bool WaitForLog(const std::string& name, const std::string& text) {
         return WaitUntil([&] { return Log(name).find(text) != std::string::npos; }, std::chrono::seconds(30));

@@ -9,10 +9,10 @@
 
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 
 #include "tests/common/log_capture.h"
 #include "tests/plugins/devsim_process.h"
+#include "utils/file_util.h"
 
 extern char** environ;
 
@@ -49,8 +49,9 @@ protected:
     }
 
     std::string Log() {
-        std::ifstream file(folder + "/orvane.log");
-        return std::string(std::istreambuf_iterator<char>(file), {});
+        std::string text;
+        FileUtil::LoadStringFromFile(folder + "/orvane.log", text);
+        return text;
     }
 
     // event_info rows of an id, "first_time|occured_cnt|param_list" each by row id. They are read
