@@ -1,10 +1,11 @@
 # Entry points: `make demo` runs the daemon's main job on this host; `make test` installs what is
-# missing, builds and runs every test; `make asan` / `make tsan` do the same under the sanitizers
-# in their own build folders.
+# missing, checks the style, builds and runs every test, and builds the tree again with clang,
+# whose thread-safety analysis checks the locking annotations. `make asan` / `make tsan` run the
+# tests under the sanitizers in their own build folders.
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: deps build demo test asan tsan clean
+.PHONY: deps build demo test clang asan tsan clean
 
 deps:
 	bash scripts/install-deps.sh
@@ -16,14 +17,23 @@ build: deps
 demo: build
 	BUILD=$(BUILD) bash scripts/demo.sh
 
-test: build
+test: build clang
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
 
+# clang with -Wthread-safety -Werror, then the naming rules over its compile database.
+clang: deps
+	bash scripts/check-style.sh
+	CC=clang CXX=clang++ cmake -S . -B build-clang -DORVANE_BENCH=OFF -DCMAKE_EXPORT_COMPILE_COMMANDS=ON
+	cmake --build build-clang -j $(JOBS)
+	bash scripts/check-style.sh build-clang
+
 asan:
-	$(MAKE) test BUILD=build-asan CMAKE_ARGS="-DORVANE_ASAN=ON -DORVANE_BENCH=OFF"
+	$(MAKE) build BUILD=build-asan CMAKE_ARGS="-DORVANE_ASAN=ON -DORVANE_BENCH=OFF"
+	cd build-asan && ctest --output-on-failure -j $(JOBS)
 
 tsan:
-	$(MAKE) test BUILD=build-tsan CMAKE_ARGS="-DORVANE_TSAN=ON -DORVANE_BENCH=OFF"
+	$(MAKE) build BUILD=build-tsan CMAKE_ARGS="-DORVANE_TSAN=ON -DORVANE_BENCH=OFF"
+	cd build-tsan && ctest --output-on-failure -j $(JOBS)
 
 clean:
-	rm -rf build build-asan build-tsan
+	rm -rf build build-asan build-tsan build-clang

@@ -1,10 +1,11 @@
-#include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <cstring>
 #include <string>
+
+#include <benchmark/benchmark.h>
 
 #include "config/event_xml_parser.h"
 #include "utils/file_util.h"

@@ -1,6 +1,5 @@
 // Event loop costs: throughput of delay-0 tasks posted from another thread, post-to-run
 // latency of a sleeping loop, and proof that an idle loop stays asleep.
-#include <benchmark/benchmark.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -11,6 +10,8 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+#include <benchmark/benchmark.h>
 
 #include "platform/event_loop.h"
 #include "utils/time_util.h"

@@ -1,5 +1,4 @@
 // Start-up of the plugin platform and the flow of events through a pipeline.
-#include <benchmark/benchmark.h>
 #include <stdlib.h>
 
 #include <atomic>
@@ -10,6 +9,8 @@
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include <benchmark/benchmark.h>
 
 #include "platform/pipeline.h"
 #include "platform/plugin_factory.h"

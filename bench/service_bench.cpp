@@ -1,6 +1,5 @@
 // Round trips of service calls over the host socket, against a running platform.
 
-#include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -9,10 +8,11 @@
 #include <vector>
 
 #include <android/log.h>
+#include <benchmark/benchmark.h>
 
+#include "host/service/host_binder_server.h"
 #include "platform/plugin_factory.h"
 #include "platform/plugin_platform.h"
-#include "service/host_binder_server.h"
 #include "service/orvane_native_service.h"
 #include "utils/file_util.h"
 
@@ -46,8 +46,8 @@ struct Fixture {
                                    "plugins:1\nEventLogProcessor[thread:bench_log_loop]:0 static\n"
                                    "pipelines:1\nbench_pipeline: EventLogProcessor\n",
                                    true);
-        std::vector<std::string> args = {"orvane", "-configDir", configDir, "-workDir", root + "/work/",
-                                         "-cloudCfgDir", root + "/cloud/"};
+        std::vector<std::string> args = {"orvane",        "-configDir",   configDir,       "-workDir",
+                                         root + "/work/", "-cloudCfgDir", root + "/cloud/"};
         std::vector<char*> argv;
         for (auto& arg : args) {
             argv.push_back(&arg[0]);
@@ -105,7 +105,8 @@ void BM_DumpSummary(benchmark::State& state) {
     Parcel reply;
     char text[4096];
     for (auto _ : state) {
-        if (client.Transact(IBinder::DUMP_TRANSACTION, data, &reply) != OK || read(pipeFds[0], text, sizeof(text)) <= 0) {
+        if (client.Transact(IBinder::DUMP_TRANSACTION, data, &reply) != OK ||
+            read(pipeFds[0], text, sizeof(text)) <= 0) {
             state.SkipWithError("dump failed");
             break;
         }

@@ -3,8 +3,6 @@
 // The database lives in $ORVANE_BENCH_DIR (default /tmp); put it on a tmpfs (/dev/shm) to
 // see the bookkeeping's own cost without the disk flushes.
 
-#include <android/log.h>
-#include <benchmark/benchmark.h>
 #include <sqlite3.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -12,6 +10,9 @@
 
 #include <fstream>
 #include <string>
+
+#include <android/log.h>
+#include <benchmark/benchmark.h>
 
 #include "storage/event_database_helper.h"
 #include "tests/common/fake_plugin_context.h"
@@ -21,8 +22,8 @@ namespace android {
 namespace Orvane {
 namespace {
 
-constexpr uint32_t EVENT_ID = 901000001;
-constexpr char OS_VERSION[] = "bench";
+constexpr uint32_t kEventId = 901000001;
+constexpr char kOsVersion[] = "bench";
 
 std::string BenchRoot() {
     const char* dir = getenv("ORVANE_BENCH_DIR");
@@ -37,8 +38,8 @@ public:
         char* made = mkdtemp(pattern.data());
         path_ = std::string(made != nullptr ? made : "/tmp") + "/";
         std::ofstream(path_ + "event_quota.xml")
-            << "<?xml version=\"1.0\"?>\n<Quota><" << OS_VERSION << "><Event eventId=\"" << EVENT_ID
-            << "\" dailyCnt=\"2000000000\"/></" << OS_VERSION << "></Quota>\n";
+                << "<?xml version=\"1.0\"?>\n<Quota><" << kOsVersion << "><Event eventId=\"" << kEventId
+                << "\" dailyCnt=\"2000000000\"/></" << kOsVersion << "></Quota>\n";
     }
     ~BenchFolder() {
         uint64_t freed = 0;
@@ -57,9 +58,11 @@ void Prefill(const std::string& dbPath, int64_t rows, uint64_t day) {
     sqlite3_open(dbPath.c_str(), &db);
     sqlite3_exec(db, "BEGIN", nullptr, nullptr, nullptr);
     for (int64_t i = 0; i < rows; i++) {
-        std::string sql = "insert into event_info (event_id,version_id,occured_cnt,first_time,param_list,expire,visible) "
-                          " values ( " + std::to_string(EVENT_ID) + ",1,1," + std::to_string(day + 50) +
-                          ",'{\"prefill\":" + std::to_string(i) + "}',0,0) ";
+        std::string sql =
+                "insert into event_info (event_id,version_id,occured_cnt,first_time,param_list,expire,visible) "
+                " values ( " +
+                std::to_string(kEventId) + ",1,1," + std::to_string(day + 50) + ",'{\"prefill\":" + std::to_string(i) +
+                "}',0,0) ";
         sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
     }
     sqlite3_exec(db, "COMMIT", nullptr, nullptr, nullptr);
@@ -70,14 +73,14 @@ void BM_ProcessFaultEvent(benchmark::State& state) {
     BenchFolder folder;
     FakePluginContext context(folder.Path(), folder.Path());
     sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-    helper->Init(&context, "event.db", OS_VERSION);
+    helper->Init(&context, "event.db", kOsVersion);
     uint64_t day = helper->GetDbStartTime();
     Prefill(helper->GetDbPath(), state.range(0), day);
     int64_t n = 0;
     for (auto _ : state) {
         sp<Event> event = new Event("bench");
         event->eventType = 2;
-        event->eventId = EVENT_ID;
+        event->eventId = kEventId;
         event->happenTime = day + 100;
         event->SetValue("param_list", "{\"n\":" + std::to_string(n++) + "}");
         helper->ProcessFaultEvent(event);
@@ -103,7 +106,7 @@ void BM_DirectSql(benchmark::State& state) {
         // Same schema, made by the real code, then closed.
         FakePluginContext context(folder.Path(), folder.Path());
         sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-        helper->Init(&context, "event.db", OS_VERSION);
+        helper->Init(&context, "event.db", kOsVersion);
         day = helper->GetDbStartTime();
         EventDatabase::getInstance()->Close();
     }
@@ -113,26 +116,32 @@ void BM_DirectSql(benchmark::State& state) {
     sqlite3_open(path.c_str(), &db);
     sqlite3_exec(db, "PRAGMA cache_size=10;", nullptr, nullptr, nullptr);
     sqlite3_exec(db, "PRAGMA synchronous=1;", nullptr, nullptr, nullptr);
-    std::string id = std::to_string(EVENT_ID);
+    std::string id = std::to_string(kEventId);
     std::string happen = std::to_string(day + 100);
     sqlite3_exec(db,
                  ("insert into event_daily (event_id,daily_cnt,over_cnt,hour_cnt,next_expire_time,last_happen_time,"
-                  "last_log_time)  values ( " + id + ",1,0,1," + std::to_string(day + 3700) + "," + happen + ",0) ")
-                     .c_str(),
+                  "last_log_time)  values ( " +
+                  id + ",1,0,1," + std::to_string(day + 3700) + "," + happen + ",0) ")
+                         .c_str(),
                  nullptr, nullptr, nullptr);
     int64_t n = 0;
     for (auto _ : state) {
         std::string params = "{\"n\":" + std::to_string(n) + "}";
-        std::string daily = "select id,event_id,daily_cnt,over_cnt,hour_cnt,next_expire_time,last_happen_time,"
-                            "last_log_time from event_daily where event_id = '" + id + "' limit 1";
-        std::string update = "update event_daily set daily_cnt=" + std::to_string(n + 2) + ", hour_cnt=" +
-                             std::to_string(n + 2) + ", next_expire_time=" + std::to_string(day + 3700) +
+        std::string daily =
+                "select id,event_id,daily_cnt,over_cnt,hour_cnt,next_expire_time,last_happen_time,"
+                "last_log_time from event_daily where event_id = '" +
+                id + "' limit 1";
+        std::string update = "update event_daily set daily_cnt=" + std::to_string(n + 2) +
+                             ", hour_cnt=" + std::to_string(n + 2) +
+                             ", next_expire_time=" + std::to_string(day + 3700) +
                              ", over_cnt=0, last_happen_time=" + happen + ", last_log_time=0  where id = '1'";
         std::string lookup = "select id,occured_cnt from event_info where event_id = '" + id +
                              "' and version_id = '1' and param_list = '" + params + "' and first_time >= '" +
                              std::to_string(day) + "' and first_time < '" + std::to_string(day + 86400) + "' limit 1";
-        std::string insert = "insert into event_info (event_id,version_id,occured_cnt,first_time,param_list,expire,"
-                             "visible)  values ( " + id + ",1,1," + happen + ",'" + params + "',0,0) ";
+        std::string insert =
+                "insert into event_info (event_id,version_id,occured_cnt,first_time,param_list,expire,"
+                "visible)  values ( " +
+                id + ",1,1," + happen + ",'" + params + "',0,0) ";
         sqlite3_exec(db, daily.c_str(), IgnoreRows, nullptr, nullptr);
         sqlite3_exec(db, update.c_str(), nullptr, nullptr, nullptr);
         sqlite3_exec(db, lookup.c_str(), IgnoreRows, nullptr, nullptr);
@@ -161,12 +170,12 @@ void BM_StoreStreamMemory(benchmark::State& state) {
         BenchFolder folder;
         FakePluginContext context(folder.Path(), folder.Path());
         sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-        helper->Init(&context, "event.db", OS_VERSION);
+        helper->Init(&context, "event.db", kOsVersion);
         uint64_t day = helper->GetDbStartTime();
         for (int i = 0; i < 10000; i++) {
             sp<Event> event = new Event("bench");
             event->eventType = 2;
-            event->eventId = EVENT_ID + i % 50;
+            event->eventId = kEventId + i % 50;
             event->happenTime = day + 100 + i;
             event->SetValue("param_list", "{\"pkg\":\"com.example.app\",\"n\":" + std::to_string(i % 500) + "}");
             helper->ProcessFaultEvent(event);
@@ -181,7 +190,13 @@ void BM_StoreStreamMemory(benchmark::State& state) {
 }
 
 // A fixed count of events on both sides, so that both tables grow alike during the run.
-BENCHMARK(BM_ProcessFaultEvent)->Arg(0)->Arg(5000)->Arg(20000)->Arg(100000)->Iterations(500)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_ProcessFaultEvent)
+        ->Arg(0)
+        ->Arg(5000)
+        ->Arg(20000)
+        ->Arg(100000)
+        ->Iterations(500)
+        ->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_DirectSql)->Arg(0)->Arg(5000)->Arg(20000)->Arg(100000)->Iterations(500)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_StoreStreamMemory)->Iterations(1)->Unit(benchmark::kMillisecond);
 

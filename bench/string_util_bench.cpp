@@ -1,6 +1,6 @@
-#include <benchmark/benchmark.h>
-
 #include <string>
+
+#include <benchmark/benchmark.h>
 
 #include "utils/string_util.h"
 

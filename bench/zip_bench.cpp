@@ -1,4 +1,3 @@
-#include <benchmark/benchmark.h>
 #include <spawn.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -8,6 +7,8 @@
 #include <random>
 #include <string>
 #include <vector>
+
+#include <benchmark/benchmark.h>
 
 #include "utils/file_util.h"
 #include "utils/zip_pack.h"
@@ -26,10 +27,10 @@ public:
         dir_ = mkdtemp(pattern);
         FileUtil::CreateDirectory(dir_ + "/logs", 0775);
         std::mt19937 random(42);
-        static const char* const kTags[] = {"ActivityManager", "WindowManager", "binder", "qxev", "SurfaceFlinger",
-                                            "PackageManager", "thermal", "audio_hw"};
-        static const char* const kWords[] = {"start", "proc", "for", "activity", "timeout", "pid", "uid",
-                                             "frame", "state", "changed", "from", "to", "took", "ms"};
+        static const char* const kTags[] = {"ActivityManager", "WindowManager",  "binder",  "qxev",
+                                            "SurfaceFlinger",  "PackageManager", "thermal", "audio_hw"};
+        static const char* const kWords[] = {"start", "proc",  "for",     "activity", "timeout", "pid",  "uid",
+                                             "frame", "state", "changed", "from",     "to",      "took", "ms"};
         auto next = [&](unsigned bound) { return static_cast<unsigned>(random() % bound); };
         auto makeText = [&](size_t bytes) {
             std::string text;
@@ -122,8 +123,8 @@ void BM_InfoZip(benchmark::State& state) {
             state.SkipWithError("zip failed");
             break;
         }
-        childCpuSeconds += usage.ru_utime.tv_sec + usage.ru_stime.tv_sec +
-                           (usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e6;
+        childCpuSeconds +=
+                usage.ru_utime.tv_sec + usage.ru_stime.tv_sec + (usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e6;
     }
     state.SetBytesProcessed(state.iterations() * files.Bytes());
     // The benchmark's own CPU time leaves out the child; this is the child's, per iteration.

@@ -77,7 +77,7 @@ int32_t EventQuotaXmlParser::LoadLocked(const std::string& directory, const std:
 }
 
 EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::GetEventQuota(const std::string& directory,
-                                                                   const std::string& section, uint32_t id) {
+                                                                    const std::string& section, uint32_t id) {
     std::lock_guard<std::mutex> lock(mutex_);
     LoadLocked(directory, section);
     DomainQuota record;
@@ -134,7 +134,7 @@ EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::GetEventQuota(const std::s
 }
 
 EventQuotaXmlParser::SummaryQuota EventQuotaXmlParser::GetSummaryQuota(const std::string& directory,
-                                                                      const std::string& section) {
+                                                                       const std::string& section) {
     std::lock_guard<std::mutex> lock(mutex_);
     LoadLocked(directory, section);
     return summary_;
@@ -228,7 +228,7 @@ void EventQuotaXmlParser::SaveTotalQuota(const std::map<std::string, std::string
 }
 
 EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::ReadDomainQuota(
-    const std::map<std::string, std::string>& attributes) const {
+        const std::map<std::string, std::string>& attributes) const {
     DomainQuota quota;
     InitValue(attributes, "eventMin", quota.eventMin, 0);
     InitValue(attributes, "eventMax", quota.eventMax, 0);
@@ -263,7 +263,7 @@ void EventQuotaXmlParser::SaveSubDomainQuota(const std::map<std::string, std::st
 
 void EventQuotaXmlParser::SaveEventQuota(const std::map<std::string, std::string>& attributes) {
     eventDailyCnt_[StringUtil::ConvertUInt(GetAttribute(attributes, "eventId"))] =
-        StringUtil::ConvertUInt(GetAttribute(attributes, "dailyCnt"));
+            StringUtil::ConvertUInt(GetAttribute(attributes, "dailyCnt"));
 }
 
 EventQuotaXmlParser::DomainQuota* EventQuotaXmlParser::FindDomain(uint32_t id) {

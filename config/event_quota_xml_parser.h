@@ -1,13 +1,13 @@
 #ifndef ORVANE_CONFIG_EVENT_QUOTA_XML_PARSER_H
 #define ORVANE_CONFIG_EVENT_QUOTA_XML_PARSER_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <map>
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include <utils/RefBase.h>
 
 #include "config/xml_parser.h"
 
@@ -58,8 +58,8 @@ public:
     SummaryQuota GetSummaryQuota(const std::string& directory, const std::string& section);
     // Counts incr more log collections for id; true when its range's limit is now reached.
     // record, when given, receives the quota that was counted against.
-    bool CheckLogCntLimitAfterIncr(const std::string& directory, const std::string& section, uint32_t id,
-                                   int32_t incr, DomainQuota* record = nullptr);
+    bool CheckLogCntLimitAfterIncr(const std::string& directory, const std::string& section, uint32_t id, int32_t incr,
+                                   DomainQuota* record = nullptr);
 
     // Reached through XmlParser while the document is read.
     bool IsMatch(const std::string& name) override;

@@ -21,7 +21,7 @@ struct LevelName {
 };
 
 constexpr LevelName kFaultLevels[] = {
-    {"INFORMATIVE", "1", 1}, {"GENERAL", "2", 2}, {"IMPORTANT", "3", 3}, {"CRITICAL", "4", 4}};
+        {"INFORMATIVE", "1", 1}, {"GENERAL", "2", 2}, {"IMPORTANT", "3", 3}, {"CRITICAL", "4", 4}};
 constexpr LevelName kPrivacyLevels[] = {{"L1", "1", 1}, {"L2", "2", 2}, {"L3", "3", 3}, {"L4", "4", 4}};
 
 template <size_t N>
@@ -84,10 +84,10 @@ sp<EventXmlParser> EventXmlParser::getInstance() {
 }
 
 uint32_t EventXmlParser::GetParamType(const std::string& type) {
-    static const std::map<std::string, uint32_t> kTypes = {
-        {"string", PARAM_TYPE_STRING}, {"bool", PARAM_TYPE_BOOL}, {"short", PARAM_TYPE_SHORT},
-        {"int", PARAM_TYPE_INT},       {"float", PARAM_TYPE_FLOAT}, {"long", PARAM_TYPE_LONG},
-        {"class", PARAM_TYPE_CLASS}};
+    static const std::map<std::string, uint32_t> kTypes = {{"string", PARAM_TYPE_STRING}, {"bool", PARAM_TYPE_BOOL},
+                                                           {"short", PARAM_TYPE_SHORT},   {"int", PARAM_TYPE_INT},
+                                                           {"float", PARAM_TYPE_FLOAT},   {"long", PARAM_TYPE_LONG},
+                                                           {"class", PARAM_TYPE_CLASS}};
     auto it = kTypes.find(type);
     return it != kTypes.end() ? it->second : PARAM_TYPE_UNKNOWN;
 }
@@ -215,7 +215,7 @@ void EventXmlParser::InitEventInfoConfig(const std::map<std::string, std::string
     found_ = true;
     building_->faultLevel = EventUtil::GetFaultLevel(GetAttribute(attributes, "FaultLevel"));
     std::string faultType = GetAttribute(attributes, "FaultType");
-    building_->faultType = faultType == "FAULT" ? FAULT_TYPE_FAULT
+    building_->faultType = faultType == "FAULT"     ? FAULT_TYPE_FAULT
                            : faultType == "STATICS" ? FAULT_TYPE_STATICS
                                                     : FAULT_TYPE_NONE;
     building_->privacyLevel = EventUtil::GetPrivacyLevel(GetAttribute(attributes, "PrivacyLevel"));
@@ -224,7 +224,7 @@ void EventXmlParser::InitEventInfoConfig(const std::map<std::string, std::string
         return;
     }
     const std::pair<const char*, int32_t EventInfoConfig::*> markers[] = {
-        {"E:", &EventInfoConfig::extendE}, {"S:", &EventInfoConfig::extendS}, {"V:", &EventInfoConfig::extendV}};
+            {"E:", &EventInfoConfig::extendE}, {"S:", &EventInfoConfig::extendS}, {"V:", &EventInfoConfig::extendV}};
     for (const std::string& item : StringUtil::SplitStr(extend, '|')) {
         for (const auto& [marker, field] : markers) {
             size_t at = item.find(marker);

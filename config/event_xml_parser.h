@@ -1,13 +1,13 @@
 #ifndef ORVANE_CONFIG_EVENT_XML_PARSER_H
 #define ORVANE_CONFIG_EVENT_XML_PARSER_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <map>
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include <utils/RefBase.h>
 
 #include "config/xml_parser.h"
 

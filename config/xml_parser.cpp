@@ -1,10 +1,10 @@
 #include "config/xml_parser.h"
 
-#include <libxml/parser.h>
-
 #include <cstdio>
 #include <cstring>
 #include <mutex>
+
+#include <libxml/parser.h>
 
 #include "utils/orvane_log.h"
 #include "utils/trace.h"
@@ -26,9 +26,8 @@ const char* OrEmpty(const xmlChar* text) {
     return text != nullptr ? reinterpret_cast<const char*>(text) : "";
 }
 
-void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI,
-                      int nb_namespaces, const xmlChar** namespaces, int nb_attributes, int nb_defaulted,
-                      const xmlChar** attributes) {
+void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI, int nb_namespaces,
+                      const xmlChar** namespaces, int nb_attributes, int nb_defaulted, const xmlChar** attributes) {
     XmlParser* parser = static_cast<XmlParser*>(ctx);
     if (parser == nullptr) {
         OLOGD("%s local=%s parser is null. pre=%s,uri=%s,nb=%d,ns=%p,nb_de=%d", OrEmpty(localname), OrEmpty(prefix),
@@ -150,7 +149,8 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
         if (xmlParseChunk(ctxt, data, length, length == 0 ? 1 : 0) != 0 && !failed) {
             // Logged once: a broken document would otherwise repeat the line for every block.
             xmlParserError(ctxt, "xmlParseChunk");
-            OLOG_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s", std::string(data, length).c_str());
+            OLOG_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s",
+                    std::string(data, length).c_str());
             failed = true;
         }
         return IsFinish() ? 1 : 0;

@@ -1,11 +1,11 @@
 #ifndef ORVANE_CONFIG_XML_PARSER_H
 #define ORVANE_CONFIG_XML_PARSER_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <map>
 #include <string>
+
+#include <utils/RefBase.h>
 
 namespace android {
 namespace Orvane {

@@ -17,18 +17,18 @@ namespace {
 constexpr off_t kMaxFileSize = 1024 * 1024;
 
 const std::regex& HeaderExpression() {
-    static const std::regex expression("(plugins|pipelines|pipelinetriggers)\\s*:\\s*(\\d+)");
-    return expression;
+    static const std::regex kExpression("(plugins|pipelines|pipelinetriggers)\\s*:\\s*(\\d+)");
+    return kExpression;
 }
 
 const std::regex& PluginExpression() {
-    static const std::regex expression("([^\\[]+)\\[([^\\[:]*):?([^:]*)\\]\\s*:(\\d+)\\s+(dynamic|static)");
-    return expression;
+    static const std::regex kExpression("([^\\[]+)\\[([^\\[:]*):?([^:]*)\\]\\s*:(\\d+)\\s+(dynamic|static)");
+    return kExpression;
 }
 
 const std::regex& PipelineExpression() {
-    static const std::regex expression("(\\S+)\\s*:(.+)");
-    return expression;
+    static const std::regex kExpression("(\\S+)\\s*:(.+)");
+    return kExpression;
 }
 
 // Digits only, as the expressions guarantee; false when the number does not fit.

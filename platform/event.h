@@ -17,17 +17,17 @@ namespace android {
 namespace Orvane {
 
 // Value keys of an event that several components read or write.
-inline constexpr char KEY_PARAM_LIST[] = "param_list";
-inline constexpr char KEY_RAW_EVENT_DB_ID[] = "rawEventDbID";
-inline constexpr char KEY_DROP_REASON[] = "dropReason";
-inline constexpr char KEY_NO_CATCH_LOG[] = "noCatchLog";
-inline constexpr char KEY_EXPIRE[] = "expire";
-inline constexpr char KEY_VISIBLE[] = "visible";
-inline constexpr char KEY_SERVICE_UPLOAD_RET[] = "EVENT_SERVICE_UPLOAD_RET";
-inline constexpr char KEY_UE_UPDATE[] = "EVENT_UE_UPDATE";
-// Values of KEY_NO_CATCH_LOG.
-inline constexpr char WAIT_LOG_CATCH[] = "WAIT_LOG_CATCH";
-inline constexpr char NO_LOG_CONFIG[] = "NO_LOG_CONFIG";
+inline constexpr char kKeyParamList[] = "param_list";
+inline constexpr char kKeyRawEventDbId[] = "rawEventDbID";
+inline constexpr char kKeyDropReason[] = "dropReason";
+inline constexpr char kKeyNoCatchLog[] = "noCatchLog";
+inline constexpr char kKeyExpire[] = "expire";
+inline constexpr char kKeyVisible[] = "visible";
+inline constexpr char kKeyServiceUploadRet[] = "EVENT_SERVICE_UPLOAD_RET";
+inline constexpr char kKeyUeUpdate[] = "EVENT_UE_UPDATE";
+// Values of kKeyNoCatchLog.
+inline constexpr char kWaitLogCatch[] = "WAIT_LOG_CATCH";
+inline constexpr char kNoLogConfig[] = "NO_LOG_CONFIG";
 
 // The record that moves through the daemon. It takes no locks: as it passes a pipeline, one
 // thread at a time (the loop of the plugin now handling it) owns it and may annotate it;

@@ -24,36 +24,36 @@ uint64_t Now() {
 
 }  // namespace
 
-EventLoop::EventLoop(const std::string& name) : name(name), looper(new Looper(false)) {}
+EventLoop::EventLoop(const std::string& name) : name_(name), looper_(new Looper(false)) {}
 
 EventLoop::~EventLoop() {
-    OLOGD("%s name :%s exit", name.c_str());
+    OLOGD("%s name :%s exit", name_.c_str());
     StopLoop();
     // Released outside the lock: an entry's destructors may reach back into this loop.
     std::deque<LoopEvent> dropped;
     {
-        Mutex::Autolock lock(mutex);
-        dropped.swap(queue);
+        Mutex::Autolock lock(mutex_);
+        dropped.swap(queue_);
     }
 }
 
 void EventLoop::StartLoop() {
-    if (thread != nullptr) {
-        OLOGE("%s name :%s thread already exist", name.c_str());
+    if (thread_ != nullptr) {
+        OLOGE("%s name :%s thread already exist", name_.c_str());
         return;
     }
-    thread = new ThreadImpl(name, [this] { ProcessEventLoop(); });
-    status_t ret = thread->run(name.c_str(), PRIORITY_DEFAULT, 0);
-    OLOGI("%s %s, run ret=%d", name.c_str(), ret);
+    thread_ = new ThreadImpl(name_, [this] { ProcessEventLoop(); });
+    status_t ret = thread_->run(name_.c_str(), PRIORITY_DEFAULT, 0);
+    OLOGI("%s %s, run ret=%d", name_.c_str(), ret);
 }
 
 void EventLoop::StopLoop() {
-    if (thread == nullptr) {
+    if (thread_ == nullptr) {
         return;
     }
-    thread->requestExit();
-    looper->wake();
-    thread->requestExitAndWait();
+    thread_->requestExit();
+    looper_->wake();
+    thread_->requestExitAndWait();
 }
 
 LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
@@ -69,16 +69,15 @@ LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
 uint64_t EventLoop::Enqueue(LoopEvent&& entry) {
     uint64_t id = entry.createTime;
     {
-        Mutex::Autolock lock(mutex);
-        queue.push_back(std::move(entry));
-        std::push_heap(queue.begin(), queue.end());
+        Mutex::Autolock lock(mutex_);
+        queue_.push_back(std::move(entry));
+        std::push_heap(queue_.begin(), queue_.end());
     }
-    looper->wake();
+    looper_->wake();
     return id;
 }
 
-uint64_t EventLoop::AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds,
-                             bool repeat) {
+uint64_t EventLoop::AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds, bool repeat) {
     if (handler == nullptr || event == nullptr) {
         OLOGE("%s handler or event is nullptr");
         return kAddFailed;
@@ -104,7 +103,7 @@ bool EventLoop::AddEventWaitResult(sp<EventHandler> handler, sp<Event> event) {
         return result.get() != -1;
     } catch (const std::exception& e) {
         // The handler threw: its failure stays on this side.
-        OLOGE("%s %s event not handled: %s", name.c_str(), e.what());
+        OLOGE("%s %s event not handled: %s", name_.c_str(), e.what());
         return false;
     }
 }
@@ -118,15 +117,15 @@ uint64_t EventLoop::AddTask(std::function<void()> task, unsigned long delaySecon
 void EventLoop::ProcessEventLoop() {
     // An entry may hold the last reference to this loop. Then the loop is destroyed on its own
     // thread when `self` goes, and from there on only the local looper may be touched.
-    sp<Looper> sleeper = looper;
+    sp<Looper> sleeper = looper_;
     unsigned long waitNs = kWaitForever;
     {
         // Empty while another thread destroys this loop; that thread's stop wakes the sleep.
         sp<EventLoop> self = wp<EventLoop>(this).promote();
         bool pending = false;
         if (self != nullptr) {
-            Mutex::Autolock lock(mutex);
-            pending = !queue.empty();
+            Mutex::Autolock lock(mutex_);
+            pending = !queue_.empty();
         }
         while (pending) {
             LoopEvent entry;
@@ -137,12 +136,12 @@ void EventLoop::ProcessEventLoop() {
             ProcessEvent(entry);
             uint64_t costUs = TimeUtil::GetTimestampUS() - startUs;
             if (costUs >= kSlowEntryUs) {
-                OLOGD("%s onevent name %s  consume time %dms", name.c_str(), static_cast<int>(costUs / 1000));
+                OLOGD("%s onevent name %s  consume time %dms", name_.c_str(), static_cast<int>(costUs / 1000));
             }
             ReEnqueueEvent(entry);
-            Mutex::Autolock lock(mutex);
-            current = nullptr;
-            pending = !queue.empty();
+            Mutex::Autolock lock(mutex_);
+            current_ = nullptr;
+            pending = !queue_.empty();
         }
     }
     // An entry due beyond the longest sleep is looked at again after that sleep.
@@ -151,18 +150,18 @@ void EventLoop::ProcessEventLoop() {
 }
 
 bool EventLoop::FetchNextEvent(unsigned long now, unsigned long& waitNs, LoopEvent& out) {
-    Mutex::Autolock lock(mutex);
-    if (queue.empty()) {
+    Mutex::Autolock lock(mutex_);
+    if (queue_.empty()) {
         return false;
     }
-    if (queue.front().targetTime > now) {
-        waitNs = queue.front().targetTime - now;
+    if (queue_.front().targetTime > now) {
+        waitNs = queue_.front().targetTime - now;
         return false;
     }
-    std::pop_heap(queue.begin(), queue.end());
-    out = std::move(queue.back());
-    queue.pop_back();
-    current = &out;
+    std::pop_heap(queue_.begin(), queue_.end());
+    out = std::move(queue_.back());
+    queue_.pop_back();
+    current_ = &out;
     return true;
 }
 
@@ -170,7 +169,7 @@ void EventLoop::ProcessEvent(LoopEvent& entry) {
     switch (entry.taskType) {
         case 1:
             if (entry.syncTask == nullptr) {
-                OLOGW("%s Loop event not execute, no sync task %s", name.c_str());
+                OLOGW("%s Loop event not execute, no sync task %s", name_.c_str());
                 return;
             }
             (*entry.syncTask)();
@@ -181,11 +180,11 @@ void EventLoop::ProcessEvent(LoopEvent& entry) {
             } else if (entry.handler != nullptr && entry.event != nullptr) {
                 entry.handler->OnEvent(entry.event);
             } else {
-                OLOGW("%s Loop event not execute, no task or handler %s", name.c_str());
+                OLOGW("%s Loop event not execute, no task or handler %s", name_.c_str());
             }
             return;
         default:
-            OLOGW("%s unrecognized task type. %s", name.c_str());
+            OLOGW("%s unrecognized task type. %s", name_.c_str());
     }
 }
 
@@ -196,9 +195,9 @@ void EventLoop::ReEnqueueEvent(LoopEvent& entry) {
     // Taken after the run, so a repeating entry drifts by its own run time.
     entry.enqueueTime = Now();
     entry.targetTime = entry.enqueueTime + entry.interval;
-    Mutex::Autolock lock(mutex);
-    queue.push_back(std::move(entry));
-    std::push_heap(queue.begin(), queue.end());
+    Mutex::Autolock lock(mutex_);
+    queue_.push_back(std::move(entry));
+    std::push_heap(queue_.begin(), queue_.end());
 }
 
 }  // namespace Orvane

@@ -23,18 +23,18 @@ namespace Orvane {
 class ThreadImpl : public Thread {
 public:
     ThreadImpl(const std::string& name, std::function<void()> function)
-        : Thread(false), name(name), function(std::move(function)) {}
+        : Thread(false), name_(name), function_(std::move(function)) {}
 
-    const std::string& GetName() const { return name; }
+    const std::string& GetName() const { return name_; }
 
 private:
     bool threadLoop() override {
-        function();
+        function_();
         return true;
     }
 
-    const std::string name;
-    const std::function<void()> function;
+    const std::string name_;
+    const std::function<void()> function_;
 };
 
 // Receiver of readiness of a file descriptor watched by a loop.
@@ -63,14 +63,13 @@ public:
     // Delivers `event` to `handler` on this loop after `delaySeconds`, again every
     // `delaySeconds` when `repeat`. Returns the entry's identifier, or UINT64_MAX for an empty
     // handler or event.
-    uint64_t AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds = 0,
-                      bool repeat = false);
+    uint64_t AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds = 0, bool repeat = false);
     // Runs handler->OnEvent(event) on this loop and waits for it; false when it returned -1 or
     // could not run. Never call it from this loop's own thread.
     bool AddEventWaitResult(sp<EventHandler> handler, sp<Event> event);
     uint64_t AddTask(std::function<void()> task, unsigned long delaySeconds = 0, bool repeat = false);
 
-    const std::string& GetName() const { return name; }
+    const std::string& GetName() const { return name_; }
 
 private:
     LoopEvent NewEntry(unsigned long delaySeconds, bool repeat) const;
@@ -82,14 +81,14 @@ private:
     void ProcessEvent(LoopEvent& entry);
     void ReEnqueueEvent(LoopEvent& entry);
 
-    const std::string name;
-    sp<ThreadImpl> thread;
-    const sp<Looper> looper;
-    LoopEvent* current = nullptr;
-    Mutex mutex;
-    std::deque<LoopEvent> queue;
+    const std::string name_;
+    sp<ThreadImpl> thread_;
+    const sp<Looper> looper_;
+    LoopEvent* current_ = nullptr;
+    Mutex mutex_;
+    std::deque<LoopEvent> queue_;
     // Kept for file-descriptor events; nothing registers any yet.
-    std::map<int, sp<FileEventHandler>> fileHandlers;
+    std::map<int, sp<FileEventHandler>> fileHandlers_;
 };
 
 }  // namespace Orvane

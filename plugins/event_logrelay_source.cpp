@@ -28,8 +28,8 @@ constexpr useconds_t kIdlePauseUs = 100 * 1000;
 
 EventLogrelaySource::~EventLogrelaySource() {
     // The epoll instance outlives OnUnload because the loop may still be waiting on it.
-    if (epollFd != -1) {
-        close(epollFd);
+    if (epollFd_ != -1) {
+        close(epollFd_);
     }
 }
 
@@ -40,50 +40,49 @@ void EventLogrelaySource::OnLoad() {
 }
 
 void EventLogrelaySource::OnUnload() {
-    stopping = true;
-    std::lock_guard<std::mutex> guard(monitorLock);
-    if (monitor == nullptr) {
+    stopping_ = true;
+    std::lock_guard<std::mutex> guard(monitorLock_);
+    if (monitor_ == nullptr) {
         return;
     }
-    monitor->unregisterExceptionLogMonitor(epollFd, deviceFd);
+    monitor_->unregisterExceptionLogMonitor(epollFd_, deviceFd_);
     // A loop still running owns the descriptor until it returns: closing it under the loop's
     // feet would let the next file opened take its number and be read instead.
-    if (!looping) {
+    if (!looping_) {
         ReleaseDevice();
     }
 }
 
 void EventLogrelaySource::ReleaseDevice() {
-    monitor->destoryExceptionLogFd(deviceFd);
-    deviceFd = -1;
-    monitor.reset();
+    monitor_->destoryExceptionLogFd(deviceFd_);
+    deviceFd_ = -1;
+    monitor_.reset();
 }
 
 void EventLogrelaySource::StartEventSource() {
     OLOGD("%s Logrelay start init");
     PluginContext* context = GetPluginContext();
-    std::string path = context != nullptr
-                           ? context->GetDevicePath(kDeviceName, android::FileMonitor::kExceptionLogPath)
-                           : android::FileMonitor::kExceptionLogPath;
+    std::string path = context != nullptr ? context->GetDevicePath(kDeviceName, android::FileMonitor::kExceptionLogPath)
+                                          : android::FileMonitor::kExceptionLogPath;
     {
-        std::lock_guard<std::mutex> guard(monitorLock);
-        monitor = std::make_unique<android::FileMonitor>();
-        int fd = monitor->openExceptionLogFd(path);
+        std::lock_guard<std::mutex> guard(monitorLock_);
+        monitor_ = std::make_unique<android::FileMonitor>();
+        int fd = monitor_->openExceptionLogFd(path);
         if (fd < 0) {
             return;
         }
-        int epfd = monitor->registerExceptionLogMonitor(fd);
+        int epfd = monitor_->registerExceptionLogMonitor(fd);
         if (epfd < 0) {
             return;
         }
-        deviceFd = fd;
-        epollFd = epfd;
-        looping = true;
+        deviceFd_ = fd;
+        epollFd_ = epfd;
+        looping_ = true;
     }
     threadLoop();
     // The loop returns only once unloading has begun.
-    std::lock_guard<std::mutex> guard(monitorLock);
-    looping = false;
+    std::lock_guard<std::mutex> guard(monitorLock_);
+    looping_ = false;
     ReleaseDevice();
 }
 
@@ -92,12 +91,12 @@ int EventLogrelaySource::threadLoop() {
     struct epoll_event events[kMaxEvents];
     char buffer[kMaxRead];
     for (;;) {
-        if (epoll_wait(epollFd, events, kMaxEvents, -1) < 0) {
+        if (epoll_wait(epollFd_, events, kMaxEvents, -1) < 0) {
             int error = errno;
             if (error != EINTR) {
                 OLOGE("%s epoll_wait: %s", strerror(error));
             }
-            if (stopping) {
+            if (stopping_) {
                 return 0;
             }
             if (error != EINTR) {
@@ -105,16 +104,16 @@ int EventLogrelaySource::threadLoop() {
             }
             continue;
         }
-        ssize_t length = read(deviceFd, buffer, kMaxRead);
+        ssize_t length = read(deviceFd_, buffer, kMaxRead);
         if (length < 1) {
-            if (stopping) {
+            if (stopping_) {
                 return 0;
             }
             usleep(kIdlePauseUs);
             continue;
         }
         ParseEvent(std::string(buffer, static_cast<size_t>(length)));
-        if (stopping) {
+        if (stopping_) {
             return 0;
         }
     }

@@ -35,12 +35,12 @@ private:
     // Closes the device and drops the monitor; called with monitorLock held.
     void ReleaseDevice();
 
-    std::atomic<bool> stopping{false};
-    std::mutex monitorLock;
-    std::unique_ptr<android::FileMonitor> monitor;
-    int epollFd = -1;
-    int deviceFd = -1;
-    bool looping = false;  // threadLoop is running and owns the device
+    std::atomic<bool> stopping_{false};
+    std::mutex monitorLock_;
+    std::unique_ptr<android::FileMonitor> monitor_;
+    int epollFd_ = -1;
+    int deviceFd_ = -1;
+    bool looping_ = false;  // threadLoop is running and owns the device
 };
 
 }  // namespace Orvane

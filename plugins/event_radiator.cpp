@@ -35,7 +35,7 @@ void EventRadiator::OnLoad() {
 }
 
 void EventRadiator::OnUnload() {
-    stopping = true;
+    stopping_ = true;
 }
 
 void EventRadiator::StartEventSource() {
@@ -58,7 +58,7 @@ void EventRadiator::StartEventSource() {
         return;
     }
     char buffer[kMaxRecord + 1] = {};
-    while (!stopping) {
+    while (!stopping_) {
         fd_set readable;
         FD_ZERO(&readable);
         FD_SET(fd, &readable);
@@ -92,7 +92,7 @@ void EventRadiator::ParseEvent(char* record) {
     // parameter text survive. The search starts at the record's beginning: a token that also
     // appears earlier (say "5" in a record of id 5) makes the value start there.
     std::string text(record);
-    event->SetValue(KEY_PARAM_LIST, text.substr(text.find(firstToken)));
+    event->SetValue(kKeyParamList, text.substr(text.find(firstToken)));
     PublishPipelineEvent(event);
 }
 

@@ -24,7 +24,7 @@ public:
     void ParseEvent(char* record);
 
 private:
-    std::atomic<bool> stopping{false};
+    std::atomic<bool> stopping_{false};
 };
 
 }  // namespace Orvane

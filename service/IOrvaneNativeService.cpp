@@ -4,11 +4,13 @@ namespace android {
 namespace Orvane {
 
 const String16& IOrvaneNativeService::descriptor() {
-    static const String16 name("android.Orvane.IOrvaneNativeService");
-    return name;
+    static const String16 kName("android.Orvane.IOrvaneNativeService");
+    return kName;
 }
 
-const String16& BnOrvaneNativeService::getInterfaceDescriptor() const { return descriptor(); }
+const String16& BnOrvaneNativeService::getInterfaceDescriptor() const {
+    return descriptor();
+}
 
 status_t BnOrvaneNativeService::onTransact(uint32_t code, const Parcel& data, Parcel* reply, uint32_t flags) {
     if (code < TRANSACTION_notifyPackLog || code > TRANSACTION_notifyUserActivated) {

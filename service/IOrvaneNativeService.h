@@ -12,7 +12,7 @@
 #include <binder/Parcel.h>
 #include <binder/Status.h>
 #else
-#include "service/host_binder.h"
+#include "host/service/host_binder.h"
 #endif
 
 namespace android {

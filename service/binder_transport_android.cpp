@@ -26,7 +26,9 @@ bool AddService(const std::string& name, const sp<BBinder>& service, const std::
     return true;
 }
 
-void JoinThreadPool() { IPCThreadState::self()->joinThreadPool(); }
+void JoinThreadPool() {
+    IPCThreadState::self()->joinThreadPool();
+}
 
 }  // namespace BinderTransport
 }  // namespace Orvane

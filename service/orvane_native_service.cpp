@@ -19,7 +19,9 @@ constexpr uid_t kSystemUid = 1000;
 const char* const kCompanionProcess = "com.quor.orvaneservice";
 constexpr int32_t kServiceIsNullError = 1;
 
-std::string ToUtf8(const String16& str) { return String8(str).string(); }
+std::string ToUtf8(const String16& str) {
+    return String8(str).string();
+}
 
 }  // namespace
 

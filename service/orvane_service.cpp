@@ -55,17 +55,19 @@ int OrvaneService::NotifyPackLog() {
     if (!platform_->PostSyncEventToTarget(kLogProcessor, event)) {
         return 0;
     }
-    return event->GetIntValue(KEY_SERVICE_UPLOAD_RET);
+    return event->GetIntValue(kKeyServiceUploadRet);
 }
 
-void OrvaneService::SetRunMode(const std::string& name, const std::string& file) { DevInfo::SetRunMode(name, file); }
+void OrvaneService::SetRunMode(const std::string& name, const std::string& file) {
+    DevInfo::SetRunMode(name, file);
+}
 
 void OrvaneService::NotifyUploadSwitch(bool on) {
     sp<Event> event = CreateEvent(__func__, kUploadSwitchEventId);
     if (event == nullptr) {
         return;
     }
-    event->SetValue(KEY_UE_UPDATE, on ? 1 : 0);
+    event->SetValue(kKeyUeUpdate, on ? 1 : 0);
     platform_->PostAsyncEventToTarget(kLogProcessor, event);
 }
 

@@ -34,9 +34,9 @@ void EventDatabase::InitDatabase(const std::string& path) {
         return;
     }
     tables_.clear();
-    for (sp<BaseTable> table : std::initializer_list<sp<BaseTable>>{
-             new EventTable(), new EventDailyTable(), new EventVersionTable(), new EventDBVersionTable(),
-             new EventUploadTable(), new RawEventTable()}) {
+    for (sp<BaseTable> table :
+         std::initializer_list<sp<BaseTable>>{new EventTable(), new EventDailyTable(), new EventVersionTable(),
+                                              new EventDBVersionTable(), new EventUploadTable(), new RawEventTable()}) {
         tables_[table->GetTableName()] = table;
     }
     database_ = new SqlDatabase(path);
@@ -70,8 +70,7 @@ bool EventDatabase::CheckLists(const char* op, const std::vector<std::string>& n
     return true;
 }
 
-bool EventDatabase::Insert(const std::string& table, std::vector<std::string> names,
-                           std::vector<std::string> values) {
+bool EventDatabase::Insert(const std::string& table, std::vector<std::string> names, std::vector<std::string> values) {
     ScopedTrace trace("DB_Insert");
     if (!CheckLists(__func__, names, values)) {
         return false;
@@ -100,13 +99,13 @@ int32_t EventDatabase::InsertAndGetID(const std::string& table, std::vector<std:
         return 0;
     }
     std::vector<SqlRow> rows =
-        database_->QueryRecord("select id from " + table + " order by id desc limit 1", {COL_ID});
+            database_->QueryRecord("select id from " + table + " order by id desc limit 1", {kColId});
     OLOGD("%s get id from %s", table.c_str());
-    return rows.empty() ? 0 : StringUtil::ConvertInt(rows[0][COL_ID]);
+    return rows.empty() ? 0 : StringUtil::ConvertInt(rows[0][kColId]);
 }
 
-bool EventDatabase::Update(const std::string& table, std::vector<std::string> names,
-                           std::vector<std::string> values, EventQuery query) {
+bool EventDatabase::Update(const std::string& table, std::vector<std::string> names, std::vector<std::string> values,
+                           EventQuery query) {
     ScopedTrace trace("DB_Update");
     if (!CheckLists(__func__, names, values)) {
         return false;
@@ -161,7 +160,7 @@ bool EventDatabase::UpdateTableColumn(const sp<BaseTable>& table) {
     }
     const std::string& name = table->GetTableName();
     std::vector<SqlRow> existing =
-        database_->QueryRecord("select name from pragma_table_info('" + name + "')", {"name"});
+            database_->QueryRecord("select name from pragma_table_info('" + name + "')", {"name"});
     if (existing.empty()) {
         OLOGI("%s query table %s failed", name.c_str());
         return false;
@@ -187,16 +186,16 @@ bool EventDatabase::UpdateTableColumn(const sp<BaseTable>& table) {
 
 void EventDatabase::RaiseDbRevision() {
     EventQuery newest;
-    newest.Select({COL_ID, COL_DB_VERSION}).Order(COL_ID, false);
-    std::vector<SqlRow> rows = Query(TBL_DB_VERSION, newest, 1);
-    OLOG_AS(ANDROID_LOG_INFO, "UpdateTableColumn", "%s query %s ret=%zu", TBL_DB_VERSION, rows.size());
+    newest.Select({kColId, kColDbVersion}).Order(kColId, false);
+    std::vector<SqlRow> rows = Query(kTblDbVersion, newest, 1);
+    OLOG_AS(ANDROID_LOG_INFO, "UpdateTableColumn", "%s query %s ret=%zu", kTblDbVersion, rows.size());
     if (rows.empty()) {
         return;
     }
     EventQuery byId;
-    byId.And(COL_ID, EventQuery::EQ, rows[0][COL_ID]);
-    int64_t revision = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][COL_DB_VERSION])) + 1;
-    Update(TBL_DB_VERSION, {COL_DB_VERSION}, {std::to_string(revision)}, byId);
+    byId.And(kColId, EventQuery::EQ, rows[0][kColId]);
+    int64_t revision = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][kColDbVersion])) + 1;
+    Update(kTblDbVersion, {kColDbVersion}, {std::to_string(revision)}, byId);
 }
 
 bool EventDatabase::Vacuum() {
@@ -213,9 +212,9 @@ int64_t EventDatabase::GetLiveSize() {
         return -1;
     }
     std::vector<SqlRow> rows = database_->QueryRecord(
-        "select (page_count - freelist_count) * page_size from pragma_page_count, pragma_freelist_count, "
-        "pragma_page_size",
-        {"size"});
+            "select (page_count - freelist_count) * page_size from pragma_page_count, pragma_freelist_count, "
+            "pragma_page_size",
+            {"size"});
     return rows.empty() ? -1 : strtoll(rows[0]["size"].c_str(), nullptr, 10);
 }
 

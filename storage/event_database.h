@@ -1,12 +1,12 @@
 #ifndef ORVANE_STORAGE_EVENT_DATABASE_H
 #define ORVANE_STORAGE_EVENT_DATABASE_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <map>
 #include <string>
 #include <vector>
+
+#include <utils/RefBase.h>
 
 #include "storage/event_query.h"
 #include "storage/sql_database.h"
@@ -28,8 +28,7 @@ public:
     sp<BaseTable> GetTable(const std::string& name) const;
     bool Insert(const std::string& table, std::vector<std::string> names, std::vector<std::string> values);
     // The id of the new row, 0 on failure.
-    int32_t InsertAndGetID(const std::string& table, std::vector<std::string> names,
-                           std::vector<std::string> values);
+    int32_t InsertAndGetID(const std::string& table, std::vector<std::string> names, std::vector<std::string> values);
     // A query without conditions updates every row.
     bool Update(const std::string& table, std::vector<std::string> names, std::vector<std::string> values,
                 EventQuery query);

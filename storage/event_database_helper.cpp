@@ -15,19 +15,19 @@ namespace android {
 namespace Orvane {
 
 namespace {
-constexpr uint64_t DAY_SECONDS = 86400;
-constexpr uint64_t HOUR_SECONDS = 3600;
+constexpr uint64_t kDaySeconds = 86400;
+constexpr uint64_t kHourSeconds = 3600;
 // Abridging first removes what is older than 60 days.
-constexpr uint64_t ABRIDGE_KEEP_SECONDS = 5184000;
-constexpr int ABRIDGE_MAX_ROUNDS = 8;
-constexpr int32_t DUMP_DEFAULT_ROWS = 20;
-constexpr uint32_t OVER_QUOTA_EVENT_ID = 908001001;
-constexpr uint32_t FAULT_EVENT_TYPE = 2;
-constexpr char FAULT_PIPELINE[] = "dftFaultEvent";
-constexpr char SENDER[] = "EventStorageManager";
+constexpr uint64_t kAbridgeKeepSeconds = 5184000;
+constexpr int kAbridgeMaxRounds = 8;
+constexpr int32_t kDumpDefaultRows = 20;
+constexpr uint32_t kOverQuotaEventId = 908001001;
+constexpr uint32_t kFaultEventType = 2;
+constexpr char kFaultPipeline[] = "dftFaultEvent";
+constexpr char kSender[] = "EventStorageManager";
 
-constexpr char USAGE_QUERY[] = "usage: query <table> [limit]\n";
-constexpr char USAGE_UPDATE[] = "usage: update <table> <column> <value> <whereColumn> <whereValue>\n";
+constexpr char kUsageQuery[] = "usage: query <table> [limit]\n";
+constexpr char kUsageUpdate[] = "usage: update <table> <column> <value> <whereColumn> <whereValue>\n";
 
 // INTEGER values stand verbatim in the SQL text, so only whole numbers may reach them.
 bool IsInteger(const std::string& text) {
@@ -77,21 +77,21 @@ bool EventDatabaseHelper::Init(PluginContext* context, const std::string& fileNa
 
 void EventDatabaseHelper::InitVersionRows() {
     EventQuery byVersion;
-    byVersion.Select({COL_ID}).And(COL_VERSION, EventQuery::EQ, osVersion_);
-    std::vector<SqlRow> rows = database_->Query(TBL_VERSION, byVersion, 1);
-    versionId_ = rows.empty() ? database_->InsertAndGetID(TBL_VERSION, {COL_VERSION}, {osVersion_})
-                              : StringUtil::ConvertInt(rows[0][COL_ID]);
+    byVersion.Select({kColId}).And(kColVersion, EventQuery::EQ, osVersion_);
+    std::vector<SqlRow> rows = database_->Query(kTblVersion, byVersion, 1);
+    versionId_ = rows.empty() ? database_->InsertAndGetID(kTblVersion, {kColVersion}, {osVersion_})
+                              : StringUtil::ConvertInt(rows[0][kColId]);
 
     EventQuery newest;
-    newest.Select({COL_ID, COL_START_TIME}).Order(COL_ID, false);
-    rows = database_->Query(TBL_DB_VERSION, newest, 1);
+    newest.Select({kColId, kColStartTime}).Order(kColId, false);
+    rows = database_->Query(kTblDbVersion, newest, 1);
     if (rows.empty()) {
         dbStartTime_ = TimeUtil::GetZeroTimestampSec(TimeUtil::GetTimestampSecond());
-        dbVersionRowId_ = database_->InsertAndGetID(TBL_DB_VERSION, {COL_DB_VERSION, COL_DEV_VERSION, COL_START_TIME},
+        dbVersionRowId_ = database_->InsertAndGetID(kTblDbVersion, {kColDbVersion, kColDevVersion, kColStartTime},
                                                     {"1", osVersion_, std::to_string(dbStartTime_)});
     } else {
-        dbVersionRowId_ = StringUtil::ConvertInt(rows[0][COL_ID]);
-        dbStartTime_ = ToU64(rows[0][COL_START_TIME]);
+        dbVersionRowId_ = StringUtil::ConvertInt(rows[0][kColId]);
+        dbStartTime_ = ToU64(rows[0][kColStartTime]);
     }
     OLOG_AS(ANDROID_LOG_INFO, "Init", "%s version %s id=%d, db version id=%d, start time=%lu", osVersion_.c_str(),
             versionId_, dbVersionRowId_, static_cast<unsigned long>(dbStartTime_));
@@ -112,51 +112,51 @@ void EventDatabaseHelper::ProcessFaultEvent(sp<Event> event) {
         return;
     }
     int64_t dayStart = TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(event->happenTime));
-    std::string params = event->GetValue(KEY_PARAM_LIST);
+    std::string params = event->GetValue(kKeyParamList);
     EventQuery sameDay;
-    sameDay.Select({COL_ID, COL_OCCURED_CNT})
-        .And(COL_EVENT_ID, EventQuery::EQ, static_cast<int64_t>(event->eventId))
-        .And(COL_VERSION_ID, EventQuery::EQ, static_cast<int64_t>(versionId_))
-        .And(COL_PARAM_LIST, EventQuery::EQ, params)
-        .And(COL_FIRST_TIME, EventQuery::GE, dayStart)
-        .And(COL_FIRST_TIME, EventQuery::LT, dayStart + static_cast<int64_t>(DAY_SECONDS));
-    std::vector<SqlRow> rows = database_->Query(TBL_EVENT_INFO, sameDay, 1);
+    sameDay.Select({kColId, kColOccuredCnt})
+            .And(kColEventId, EventQuery::EQ, static_cast<int64_t>(event->eventId))
+            .And(kColVersionId, EventQuery::EQ, static_cast<int64_t>(versionId_))
+            .And(kColParamList, EventQuery::EQ, params)
+            .And(kColFirstTime, EventQuery::GE, dayStart)
+            .And(kColFirstTime, EventQuery::LT, dayStart + static_cast<int64_t>(kDaySeconds));
+    std::vector<SqlRow> rows = database_->Query(kTblEventInfo, sameDay, 1);
     std::string happenTime = std::to_string(event->happenTime);
     if (rows.empty()) {
-        database_->Insert(TBL_EVENT_INFO,
-                          {COL_EVENT_ID, COL_VERSION_ID, COL_OCCURED_CNT, COL_FIRST_TIME, COL_PARAM_LIST, COL_EXPIRE,
-                           COL_VISIBLE},
-                          {std::to_string(event->eventId), std::to_string(versionId_), "1", happenTime, params,
-                           MarkOrZero(event->GetValue(KEY_EXPIRE)), MarkOrZero(event->GetValue(KEY_VISIBLE))});
+        database_->Insert(
+                kTblEventInfo,
+                {kColEventId, kColVersionId, kColOccuredCnt, kColFirstTime, kColParamList, kColExpire, kColVisible},
+                {std::to_string(event->eventId), std::to_string(versionId_), "1", happenTime, params,
+                 MarkOrZero(event->GetValue(kKeyExpire)), MarkOrZero(event->GetValue(kKeyVisible))});
         return;
     }
     // first_time follows the latest occurrence of the day, so the row stays matched all day.
-    int64_t occurred = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][COL_OCCURED_CNT])) + 1;
+    int64_t occurred = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][kColOccuredCnt])) + 1;
     EventQuery byId;
-    byId.And(COL_ID, EventQuery::EQ, rows[0][COL_ID]);
-    database_->Update(TBL_EVENT_INFO, {COL_OCCURED_CNT, COL_FIRST_TIME}, {std::to_string(occurred), happenTime}, byId);
+    byId.And(kColId, EventQuery::EQ, rows[0][kColId]);
+    database_->Update(kTblEventInfo, {kColOccuredCnt, kColFirstTime}, {std::to_string(occurred), happenTime}, byId);
 }
 
 bool EventDatabaseHelper::DetectCanDrop(sp<Event> event) {
     if (!ProcessNewDayEvent(event)) {
-        if (database_->GetTable(TBL_EVENT_DAILY) == nullptr) {
-            OLOGE("%s failed get tbl %s no drop", TBL_EVENT_DAILY);
+        if (database_->GetTable(kTblEventDaily) == nullptr) {
+            OLOGE("%s failed get tbl %s no drop", kTblEventDaily);
             return false;
         }
         EventQuery byEvent;
-        byEvent.Select(database_->GetTable(TBL_EVENT_DAILY)->GetFieldNameList())
-            .And(COL_EVENT_ID, EventQuery::EQ, static_cast<int64_t>(event->eventId));
-        std::vector<SqlRow> rows = database_->Query(TBL_EVENT_DAILY, byEvent, 1);
+        byEvent.Select(database_->GetTable(kTblEventDaily)->GetFieldNameList())
+                .And(kColEventId, EventQuery::EQ, static_cast<int64_t>(event->eventId));
+        std::vector<SqlRow> rows = database_->Query(kTblEventDaily, byEvent, 1);
         if (!rows.empty()) {
             return DetectDropByTime(event, rows[0]);
         }
     }
     DomainQuota quota = GetQuota(event->eventId);
     uint64_t lastLog = CheckAndGetLogTime(event, quota, 0);
-    database_->Insert(TBL_EVENT_DAILY,
-                      {COL_EVENT_ID, COL_DAILY_CNT, COL_OVER_CNT, COL_HOUR_CNT, COL_NEXT_EXPIRE_TIME,
-                       COL_LAST_HAPPEN_TIME, COL_LAST_LOG_TIME},
-                      {std::to_string(event->eventId), "1", "0", "1", std::to_string(event->happenTime + HOUR_SECONDS),
+    database_->Insert(kTblEventDaily,
+                      {kColEventId, kColDailyCnt, kColOverCnt, kColHourCnt, kColNextExpireTime, kColLastHappenTime,
+                       kColLastLogTime},
+                      {std::to_string(event->eventId), "1", "0", "1", std::to_string(event->happenTime + kHourSeconds),
                        std::to_string(event->happenTime), std::to_string(lastLog)});
     return false;
 }
@@ -168,19 +168,19 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         auto it = row.find(column);
         return it == row.end() ? 0 : StringUtil::ConvertUInt(it->second);
     };
-    uint32_t overCnt = read(COL_OVER_CNT);
-    uint32_t dailyCnt = read(COL_DAILY_CNT);
-    uint32_t hourCnt = read(COL_HOUR_CNT);
-    uint64_t nextExpire = read(COL_NEXT_EXPIRE_TIME);
-    uint64_t lastHappen = read(COL_LAST_HAPPEN_TIME);
-    uint64_t lastLog = read(COL_LAST_LOG_TIME);
+    uint32_t overCnt = read(kColOverCnt);
+    uint32_t dailyCnt = read(kColDailyCnt);
+    uint32_t hourCnt = read(kColHourCnt);
+    uint64_t nextExpire = read(kColNextExpireTime);
+    uint64_t lastHappen = read(kColLastHappenTime);
+    uint64_t lastLog = read(kColLastLogTime);
     int eventId = static_cast<int>(event->eventId);
     OLOGD("%s event %d parser maxCnt=%u lastTime=%lu same=%d", eventId, maxCnt, static_cast<unsigned long>(lastHappen),
           quota.same);
 
     bool dropped = false;
     if (maxCnt <= dailyCnt) {
-        event->SetValue(KEY_DROP_REASON, "over daily quota");
+        event->SetValue(kKeyDropReason, "over daily quota");
         overCnt++;
         ReportEventOverQuota(event, dailyCnt, maxCnt);
         OLOGI("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt), maxCnt);
@@ -190,14 +190,14 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         uint64_t remaining = maxCnt - dailyCnt;
         if (now >= nextExpire) {
             // The period advances one hour per event, so it catches up after a quiet spell.
-            nextExpire += HOUR_SECONDS;
+            nextExpire += kHourSeconds;
             hourCnt = 1;
         } else {
             uint64_t halfCnt = ((remaining + 23) / 24 + 1) / 2;
             uint64_t newHour = static_cast<uint64_t>(hourCnt) + 1;
             if (newHour > halfCnt &&
-                now - lastHappen < (dbStartTime_ + DAY_SECONDS - now) * (newHour - halfCnt) / remaining) {
-                event->SetValue(KEY_DROP_REASON, "event happen too sequence, drop it by punish");
+                now - lastHappen < (dbStartTime_ + kDaySeconds - now) * (newHour - halfCnt) / remaining) {
+                event->SetValue(kKeyDropReason, "event happen too sequence, drop it by punish");
                 OLOGI("%s event %d over hour cnt drop it, hourCnt=%d halfCnt=%d, maxCnt=%u", eventId,
                       static_cast<int>(newHour), static_cast<int>(halfCnt), maxCnt);
                 dailyCnt--;  // the stored count stays as it was
@@ -213,30 +213,29 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         }
     }
     EventQuery byId;
-    byId.And(COL_ID, EventQuery::EQ, row[COL_ID]);
-    database_->Update(TBL_EVENT_DAILY,
-                      {COL_DAILY_CNT, COL_HOUR_CNT, COL_NEXT_EXPIRE_TIME, COL_OVER_CNT, COL_LAST_HAPPEN_TIME,
-                       COL_LAST_LOG_TIME},
-                      {std::to_string(static_cast<uint64_t>(dailyCnt) + 1), std::to_string(hourCnt),
-                       std::to_string(nextExpire), std::to_string(overCnt), std::to_string(lastHappen),
-                       std::to_string(lastLog)},
-                      byId);
+    byId.And(kColId, EventQuery::EQ, row[kColId]);
+    database_->Update(
+            kTblEventDaily,
+            {kColDailyCnt, kColHourCnt, kColNextExpireTime, kColOverCnt, kColLastHappenTime, kColLastLogTime},
+            {std::to_string(static_cast<uint64_t>(dailyCnt) + 1), std::to_string(hourCnt), std::to_string(nextExpire),
+             std::to_string(overCnt), std::to_string(lastHappen), std::to_string(lastLog)},
+            byId);
     return dropped;
 }
 
 bool EventDatabaseHelper::ProcessNewDayEvent(sp<Event> event) {
     // A clock set back never starts a new day.
-    if (event->happenTime < dbStartTime_ + DAY_SECONDS) {
+    if (event->happenTime < dbStartTime_ + kDaySeconds) {
         return false;
     }
-    uint64_t oldEnd = dbStartTime_ + DAY_SECONDS;
+    uint64_t oldEnd = dbStartTime_ + kDaySeconds;
     dbStartTime_ = TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(event->happenTime));
     OLOGD("%s daily tbl truncate event happen time %ld, start time=%lddb time =%ld",
           static_cast<long>(event->happenTime), static_cast<long>(dbStartTime_), static_cast<long>(oldEnd));
-    database_->TruncateAndCreate(TBL_EVENT_DAILY);
+    database_->TruncateAndCreate(kTblEventDaily);
     EventQuery byId;
-    byId.And(COL_ID, EventQuery::EQ, static_cast<int64_t>(dbVersionRowId_));
-    database_->Update(TBL_DB_VERSION, {COL_START_TIME}, {std::to_string(dbStartTime_)}, byId);
+    byId.And(kColId, EventQuery::EQ, static_cast<int64_t>(dbVersionRowId_));
+    database_->Update(kTblDbVersion, {kColStartTime}, {std::to_string(dbStartTime_)}, byId);
     return true;
 }
 
@@ -250,37 +249,37 @@ void EventDatabaseHelper::ReportEventOverQuota(sp<Event> event, uint32_t dailyCn
         OLOGE("%s no work loop, event %u not reported", event->eventId);
         return;
     }
-    sp<Event> report = new Event(SENDER);
-    report->eventType = FAULT_EVENT_TYPE;
-    report->eventId = OVER_QUOTA_EVENT_ID;
+    sp<Event> report = new Event(kSender);
+    report->eventType = kFaultEventType;
+    report->eventId = kOverQuotaEventId;
     report->happenTime = event->happenTime;
     char params[96];
     snprintf(params, sizeof(params), "{\"EventId\":%u,\"DailyCnt\":%u,\"MaxCnt\":%u}", event->eventId, dailyCnt,
              maxCnt);
-    report->SetValue(KEY_PARAM_LIST, params);
+    report->SetValue(kKeyParamList, params);
     OLOGI("%s event %u reached its daily quota %u", event->eventId, maxCnt);
     // Posted, so that the report never re-enters the storage step that is running now.
     PluginContext* context = context_;
     loop->AddTask([context, report]() {
-        if (!context->InsertEventToPipeline(FAULT_PIPELINE, report)) {
-            OLOG_AS(ANDROID_LOG_WARN, "ReportEventOverQuota", "%s no pipeline %s", FAULT_PIPELINE);
+        if (!context->InsertEventToPipeline(kFaultPipeline, report)) {
+            OLOG_AS(ANDROID_LOG_WARN, "ReportEventOverQuota", "%s no pipeline %s", kFaultPipeline);
         }
     });
 }
 
 uint64_t EventDatabaseHelper::CheckAndGetLogTime(sp<Event> event, const DomainQuota& quota, uint64_t lastLogTime) {
     if (!logRuleLookup_ || !logRuleLookup_(event->eventId)) {
-        event->SetValue(KEY_NO_CATCH_LOG, NO_LOG_CONFIG);
+        event->SetValue(kKeyNoCatchLog, kNoLogConfig);
         return lastLogTime;
     }
-    sp<EventInfoConfig> info = EventXmlParser::getInstance()->GetEventInfoConfig(context_->GetConfigDir(),
-                                                                                 event->eventId);
+    sp<EventInfoConfig> info =
+            EventXmlParser::getInstance()->GetEventInfoConfig(context_->GetConfigDir(), event->eventId);
     int32_t spacing = info != nullptr ? info->extendS : 0;
     uint64_t now = event->happenTime;
     bool tooSoon = spacing > 0 && now < lastLogTime + static_cast<uint64_t>(spacing);
-    bool caughtToday = !quota.same && lastLogTime >= dbStartTime_ && lastLogTime < dbStartTime_ + DAY_SECONDS;
+    bool caughtToday = !quota.same && lastLogTime >= dbStartTime_ && lastLogTime < dbStartTime_ + kDaySeconds;
     if (tooSoon || caughtToday) {
-        event->SetValue(KEY_NO_CATCH_LOG, WAIT_LOG_CATCH);
+        event->SetValue(kKeyNoCatchLog, kWaitLogCatch);
         return lastLogTime;
     }
     return now;
@@ -291,9 +290,9 @@ void EventDatabaseHelper::SaveRawEvent(sp<Event> event) {
         return;
     }
     int32_t id = database_->InsertAndGetID(
-        TBL_RAW_EVENTS, {COL_EVENT_ID, COL_PARAM_LIST, COL_TIMESTAMP},
-        {std::to_string(event->eventId), event->GetValue(KEY_PARAM_LIST), std::to_string(event->happenTime)});
-    event->SetValue(KEY_RAW_EVENT_DB_ID, std::to_string(id));
+            kTblRawEvents, {kColEventId, kColParamList, kColTimestamp},
+            {std::to_string(event->eventId), event->GetValue(kKeyParamList), std::to_string(event->happenTime)});
+    event->SetValue(kKeyRawEventDbId, std::to_string(id));
 }
 
 void EventDatabaseHelper::SaveUserActivateTime(sp<Event> event) {
@@ -301,8 +300,8 @@ void EventDatabaseHelper::SaveUserActivateTime(sp<Event> event) {
         return;
     }
     EventQuery byId;
-    byId.And(COL_ID, EventQuery::EQ, static_cast<int64_t>(dbVersionRowId_));
-    database_->Update(TBL_DB_VERSION, {COL_ACTIVATE_TIME}, {std::to_string(event->happenTime)}, byId);
+    byId.And(kColId, EventQuery::EQ, static_cast<int64_t>(dbVersionRowId_));
+    database_->Update(kTblDbVersion, {kColActivateTime}, {std::to_string(event->happenTime)}, byId);
     DevInfo::SetActivateTime(event->happenTime);
 }
 
@@ -316,16 +315,16 @@ void EventDatabaseHelper::AbridgeDbSize(uint32_t sizeLimit) {
         return;
     }
     uint64_t now = TimeUtil::GetTimestampSecond();
-    uint64_t cutOff = now > ABRIDGE_KEEP_SECONDS ? now - ABRIDGE_KEEP_SECONDS : 0;
-    for (int round = 1; round <= ABRIDGE_MAX_ROUNDS; round++) {
+    uint64_t cutOff = now > kAbridgeKeepSeconds ? now - kAbridgeKeepSeconds : 0;
+    for (int round = 1; round <= kAbridgeMaxRounds; round++) {
         EventQuery oldEvents;
-        oldEvents.And(COL_FIRST_TIME, EventQuery::LT, static_cast<int64_t>(cutOff));
+        oldEvents.And(kColFirstTime, EventQuery::LT, static_cast<int64_t>(cutOff));
         EventQuery oldRaw;
-        oldRaw.And(COL_TIMESTAMP, EventQuery::LT, static_cast<int64_t>(cutOff));
-        int32_t events = CountRows(TBL_EVENT_INFO, oldEvents);
-        int32_t raws = CountRows(TBL_RAW_EVENTS, oldRaw);
-        database_->Delete(TBL_EVENT_INFO, oldEvents);
-        database_->Delete(TBL_RAW_EVENTS, oldRaw);
+        oldRaw.And(kColTimestamp, EventQuery::LT, static_cast<int64_t>(cutOff));
+        int32_t events = CountRows(kTblEventInfo, oldEvents);
+        int32_t raws = CountRows(kTblRawEvents, oldRaw);
+        database_->Delete(kTblEventInfo, oldEvents);
+        database_->Delete(kTblRawEvents, oldRaw);
         int64_t liveSize = database_->GetLiveSize();
         OLOGI("%s round %d cut-off %lu deleted %d events %d raw events, %ld bytes left", round,
               static_cast<unsigned long>(cutOff), events, raws, static_cast<long>(liveSize));
@@ -339,14 +338,14 @@ void EventDatabaseHelper::AbridgeDbSize(uint32_t sizeLimit) {
 
 void EventDatabaseHelper::DumpQueryDb(int fd, const std::vector<std::string>& args) {
     if (args.size() < 2 || args.size() > 3) {
-        dprintf(fd, "%s", USAGE_QUERY);
+        dprintf(fd, "%s", kUsageQuery);
         return;
     }
-    int32_t limit = DUMP_DEFAULT_ROWS;
+    int32_t limit = kDumpDefaultRows;
     if (args.size() == 3) {
         limit = StringUtil::ConvertInt(args[2]);
         if (limit <= 0) {
-            dprintf(fd, "%s", USAGE_QUERY);
+            dprintf(fd, "%s", kUsageQuery);
             return;
         }
     }
@@ -362,7 +361,7 @@ void EventDatabaseHelper::DumpTable(int fd, const std::string& table, int32_t li
     std::vector<std::string> names = tbl->GetFieldNameList();
     dprintf(fd, "%s\n", Join(names, " | ").c_str());
     EventQuery newestFirst;
-    newestFirst.Select(names).Order(COL_ID, false);
+    newestFirst.Select(names).Order(kColId, false);
     for (auto& row : database_->Query(table, newestFirst, limit)) {
         std::vector<std::string> values;
         for (const auto& name : names) {
@@ -374,7 +373,7 @@ void EventDatabaseHelper::DumpTable(int fd, const std::string& table, int32_t li
 
 void EventDatabaseHelper::DumpUpdateDb(int fd, const std::vector<std::string>& args) {
     if (args.size() != 6) {
-        dprintf(fd, "%s", USAGE_UPDATE);
+        dprintf(fd, "%s", kUsageUpdate);
         return;
     }
     const std::string& table = args[1];
@@ -410,7 +409,8 @@ void EventDatabaseHelper::DumpQuota(int fd, const std::string& eventId) {
     DomainQuota range;
     EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(context_->GetConfigDir(), osVersion_, id, 0, &range);
     dprintf(fd,
-            "EventId %u quota :\n    dailyCnt = %u\n    logCnt = %u    realLog = %u    logSpace = %u    sameLog = %u    "
+            "EventId %u quota :\n    dailyCnt = %u\n    logCnt = %u    realLog = %u    logSpace = %u    sameLog = %u   "
+            " "
             "inSub = %u\n    minEvent = %u    maxEvent = %u\n",
             id, quota.dailyCnt, quota.maxLogCnt, static_cast<uint32_t>(quota.logCnt), quota.logSpace,
             static_cast<uint32_t>(quota.same), static_cast<uint32_t>(quota.sub), range.eventMin, range.eventMax);

@@ -1,12 +1,12 @@
 #ifndef ORVANE_STORAGE_EVENT_DATABASE_HELPER_H
 #define ORVANE_STORAGE_EVENT_DATABASE_HELPER_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <functional>
 #include <string>
 #include <vector>
+
+#include <utils/RefBase.h>
 
 #include "config/event_quota_xml_parser.h"
 #include "platform/event.h"

@@ -14,9 +14,9 @@ struct OpText {
 };
 
 // Indexed by Op - 1.
-constexpr OpText OP_TEXTS[] = {
-    {" = '", "'"},  {" != '", "'"}, {" < '", "'"},        {" <= '", "'"},
-    {" > '", "'"},  {" >= '", "'"}, {" like '%", "%'"}, {" not like '%", "%'"},
+constexpr OpText kOpTexts[] = {
+        {" = '", "'"}, {" != '", "'"}, {" < '", "'"},      {" <= '", "'"},
+        {" > '", "'"}, {" >= '", "'"}, {" like '%", "%'"}, {" not like '%", "%'"},
 };
 
 bool EndsWithOpenGroup(const std::string& where) {
@@ -46,7 +46,7 @@ std::string EventQuery::GenerateCondStatement(const std::string& column, Op op, 
     if (op < EQ || op > NOT_LIKE) {
         return "";
     }
-    const OpText& text = OP_TEXTS[op - EQ];
+    const OpText& text = kOpTexts[op - EQ];
     return column + text.before + StringUtil::EscapeSqliteChar(value) + text.after;
 }
 

@@ -20,22 +20,22 @@ namespace Orvane {
 ORVANE_REGISTER_PLUGIN(EventStorageManager);
 
 namespace {
-constexpr char DB_FILE_NAME[] = "event.db";
-constexpr char PROP_CHECK_SIZE[] = "orvane.store.checksize";
-constexpr char PROP_CHECK_TIME[] = "orvane.store.checktime";
-constexpr char PROP_SAFE_CHECK[] = "persist.sys.orvane.safecheck";
-constexpr uint32_t DEFAULT_CHECK_SIZE = 209715200;
-constexpr uint32_t DEFAULT_CHECK_TIME = 86400;
+constexpr char kDbFileName[] = "event.db";
+constexpr char kPropCheckSize[] = "orvane.store.checksize";
+constexpr char kPropCheckTime[] = "orvane.store.checktime";
+constexpr char kPropSafeCheck[] = "persist.sys.orvane.safecheck";
+constexpr uint32_t kDefaultCheckSize = 209715200;
+constexpr uint32_t kDefaultCheckTime = 86400;
 
-constexpr uint32_t CATEGORY_CONTROL = 1;
-constexpr uint32_t CATEGORY_RAW = 4;
-constexpr uint32_t USER_ACTIVATE_EVENT_ID = 105;
-constexpr uint32_t RAW_ID_MIN = 100000;
-constexpr uint32_t RAW_ID_MAX = 199999;
+constexpr uint32_t kCategoryControl = 1;
+constexpr uint32_t kCategoryRaw = 4;
+constexpr uint32_t kUserActivateEventId = 105;
+constexpr uint32_t kRawIdMin = 100000;
+constexpr uint32_t kRawIdMax = 199999;
 // Handed back for ids that are not stored; as a handler result it ends the pipeline.
-constexpr EVENT_RET NOT_STORED = static_cast<EVENT_RET>(0xFFFFFFFFu);
+constexpr EVENT_RET kNotStored = static_cast<EVENT_RET>(0xFFFFFFFFu);
 // How long a dump waits for the storage loop before giving up.
-constexpr auto DUMP_WAIT = std::chrono::seconds(10);
+constexpr auto kDumpWait = std::chrono::seconds(10);
 
 bool IsFaultId(uint32_t id) {
     return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
@@ -47,7 +47,7 @@ EventStorageManager::EventStorageManager() : helper_(new EventDatabaseHelper()) 
 void EventStorageManager::OnLoad() {
     SetVersion("EventStorageManager-1.0");
     SetName("EventStorageManager");
-    helper_->Init(GetPluginContext(), DB_FILE_NAME, DevInfo::GetQuorVersion());
+    helper_->Init(GetPluginContext(), kDbFileName, DevInfo::GetQuorVersion());
     sp<EventLoop> loop = GetLooper();
     if (loop == nullptr) {
         OLOGE("%s storage manager looper not set");
@@ -60,13 +60,13 @@ void EventStorageManager::ScheduleCheck(const sp<EventLoop>& loop, uint32_t dela
     // Weak, so that the queued check does not keep the plugin (and with it its loop) alive.
     wp<EventStorageManager> weak = this;
     loop->AddTask(
-        [weak]() {
-            sp<EventStorageManager> self = weak.promote();
-            if (self != nullptr) {
-                self->CheckEventStore();
-            }
-        },
-        delaySeconds, false);
+            [weak]() {
+                sp<EventStorageManager> self = weak.promote();
+                if (self != nullptr) {
+                    self->CheckEventStore();
+                }
+            },
+            delaySeconds, false);
 }
 
 uint32_t EventStorageManager::GetStoreProperity(const std::string& name, uint32_t defaultValue) {
@@ -81,12 +81,12 @@ uint32_t EventStorageManager::GetStoreProperity(const std::string& name, uint32_
 }
 
 void EventStorageManager::CheckEventStore() {
-    uint32_t checkSize = GetStoreProperity(PROP_CHECK_SIZE, DEFAULT_CHECK_SIZE);
+    uint32_t checkSize = GetStoreProperity(kPropCheckSize, kDefaultCheckSize);
     int64_t fileSize = FileUtil::GetFileSize(helper_->GetDbPath());
     if (fileSize >= 0 && static_cast<uint32_t>(fileSize) >= checkSize) {
         helper_->AbridgeDbSize(checkSize);
     }
-    uint32_t checkTime = GetStoreProperity(PROP_CHECK_TIME, DEFAULT_CHECK_TIME);
+    uint32_t checkTime = GetStoreProperity(kPropCheckTime, kDefaultCheckTime);
     sp<EventLoop> loop = GetLooper();
     if (loop != nullptr) {
         ScheduleCheck(loop, checkTime);
@@ -99,19 +99,19 @@ EVENT_RET EventStorageManager::OnEvent(sp<Event>& event) {
     }
     OLOGD("%s EventStorageManager event=%u,%d", event->eventId, static_cast<int>(event->eventType));
     switch (event->eventType) {
-        case CATEGORY_RAW:
-            if (event->eventId >= RAW_ID_MIN && event->eventId <= RAW_ID_MAX) {
+        case kCategoryRaw:
+            if (event->eventId >= kRawIdMin && event->eventId <= kRawIdMax) {
                 helper_->SaveRawEvent(event);
             }
             return 0;
-        case CATEGORY_CONTROL:
-            if (event->eventId == USER_ACTIVATE_EVENT_ID) {
+        case kCategoryControl:
+            if (event->eventId == kUserActivateEventId) {
                 helper_->SaveUserActivateTime(event);
             }
             return 0;
         default:
             if (!IsFaultId(event->eventId)) {
-                return NOT_STORED;
+                return kNotStored;
             }
             helper_->ProcessFaultEvent(event);
             return 0;
@@ -141,7 +141,7 @@ void EventStorageManager::Dump(int fd, const std::vector<std::string>& args) {
         close(taskFd);
         done->set_value();
     });
-    if (finished.wait_for(DUMP_WAIT) != std::future_status::ready) {
+    if (finished.wait_for(kDumpWait) != std::future_status::ready) {
         OLOGW("%s storage loop busy, dump %s not done in time", args[0].c_str());
         dprintf(fd, "storage busy, try again\n");
     }
@@ -153,7 +153,7 @@ void EventStorageManager::RunDump(int fd, const std::vector<std::string>& args) 
         helper_->DumpQueryDb(fd, args);
     } else if (command == "update") {
         PluginContext* context = GetPluginContext();
-        if (context != nullptr && context->GetSysProperity(PROP_SAFE_CHECK, "") == "0") {
+        if (context != nullptr && context->GetSysProperity(kPropSafeCheck, "") == "0") {
             helper_->DumpUpdateDb(fd, args);
         } else {
             dprintf(fd, "not support cmd\n");
@@ -161,8 +161,9 @@ void EventStorageManager::RunDump(int fd, const std::vector<std::string>& args) 
     } else if (command == "quota" && args.size() >= 2) {
         helper_->DumpQuota(fd, args[1]);
     } else {
-        dprintf(fd, "usage: query <table> [limit] | update <table> <column> <value> <whereColumn> <whereValue> | "
-                    "quota <eventId>\n");
+        dprintf(fd,
+                "usage: query <table> [limit] | update <table> <column> <value> <whereColumn> <whereValue> | "
+                "quota <eventId>\n");
     }
 }
 

@@ -5,7 +5,7 @@ namespace Orvane {
 
 namespace {
 sp<SqlField> KeyField() {
-    return new SqlField(COL_ID, SqlFieldType::INTEGER, true, true, false);
+    return new SqlField(kColId, SqlFieldType::INTEGER, true, true, false);
 }
 
 sp<SqlField> NotNull(const char* name, SqlFieldType type) {
@@ -17,58 +17,58 @@ sp<SqlField> Nullable(const char* name, SqlFieldType type) {
 }
 }  // namespace
 
-EventTable::EventTable() : BaseTable(TBL_EVENT_INFO) {
+EventTable::EventTable() : BaseTable(kTblEventInfo) {
     AddField(KeyField());
-    AddField(NotNull(COL_EVENT_ID, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_TRACE_ID, SqlFieldType::TEXT));
-    AddField(Nullable(COL_PSPAN_ID, SqlFieldType::TEXT));
-    AddField(Nullable(COL_SPAN_ID, SqlFieldType::TEXT));
-    AddField(NotNull(COL_VERSION_ID, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_OCCURED_CNT, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_FIRST_TIME, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_PARAM_LIST, SqlFieldType::TEXT));
-    AddField(Nullable(COL_EXPIRE, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_VISIBLE, SqlFieldType::INTEGER));
+    AddField(NotNull(kColEventId, SqlFieldType::INTEGER));
+    AddField(Nullable(kColTraceId, SqlFieldType::TEXT));
+    AddField(Nullable(kColPspanId, SqlFieldType::TEXT));
+    AddField(Nullable(kColSpanId, SqlFieldType::TEXT));
+    AddField(NotNull(kColVersionId, SqlFieldType::INTEGER));
+    AddField(Nullable(kColOccuredCnt, SqlFieldType::INTEGER));
+    AddField(Nullable(kColFirstTime, SqlFieldType::INTEGER));
+    AddField(Nullable(kColParamList, SqlFieldType::TEXT));
+    AddField(Nullable(kColExpire, SqlFieldType::INTEGER));
+    AddField(Nullable(kColVisible, SqlFieldType::INTEGER));
 }
 
-EventDailyTable::EventDailyTable() : BaseTable(TBL_EVENT_DAILY) {
+EventDailyTable::EventDailyTable() : BaseTable(kTblEventDaily) {
     AddField(KeyField());
-    AddField(NotNull(COL_EVENT_ID, SqlFieldType::INTEGER));
-    AddField(NotNull(COL_DAILY_CNT, SqlFieldType::INTEGER));
-    AddField(NotNull(COL_OVER_CNT, SqlFieldType::INTEGER));
-    AddField(NotNull(COL_HOUR_CNT, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_NEXT_EXPIRE_TIME, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_LAST_HAPPEN_TIME, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_LAST_LOG_TIME, SqlFieldType::INTEGER));
+    AddField(NotNull(kColEventId, SqlFieldType::INTEGER));
+    AddField(NotNull(kColDailyCnt, SqlFieldType::INTEGER));
+    AddField(NotNull(kColOverCnt, SqlFieldType::INTEGER));
+    AddField(NotNull(kColHourCnt, SqlFieldType::INTEGER));
+    AddField(Nullable(kColNextExpireTime, SqlFieldType::INTEGER));
+    AddField(Nullable(kColLastHappenTime, SqlFieldType::INTEGER));
+    AddField(Nullable(kColLastLogTime, SqlFieldType::INTEGER));
 }
 
-EventVersionTable::EventVersionTable() : BaseTable(TBL_VERSION) {
+EventVersionTable::EventVersionTable() : BaseTable(kTblVersion) {
     AddField(KeyField());
-    AddField(NotNull(COL_VERSION, SqlFieldType::TEXT));
+    AddField(NotNull(kColVersion, SqlFieldType::TEXT));
 }
 
-EventDBVersionTable::EventDBVersionTable() : BaseTable(TBL_DB_VERSION) {
+EventDBVersionTable::EventDBVersionTable() : BaseTable(kTblDbVersion) {
     AddField(KeyField());
-    AddField(NotNull(COL_DB_VERSION, SqlFieldType::INTEGER));
-    AddField(NotNull(COL_DEV_VERSION, SqlFieldType::TEXT));
-    AddField(NotNull(COL_START_TIME, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_ACTIVATE_TIME, SqlFieldType::INTEGER));
+    AddField(NotNull(kColDbVersion, SqlFieldType::INTEGER));
+    AddField(NotNull(kColDevVersion, SqlFieldType::TEXT));
+    AddField(NotNull(kColStartTime, SqlFieldType::INTEGER));
+    AddField(Nullable(kColActivateTime, SqlFieldType::INTEGER));
 }
 
-EventUploadTable::EventUploadTable() : BaseTable(TBL_UPLOAD) {
+EventUploadTable::EventUploadTable() : BaseTable(kTblUpload) {
     AddField(KeyField());
-    AddField(NotNull(COL_YEAR, SqlFieldType::INTEGER));
-    for (const char* month : COL_MONTHS) {
+    AddField(NotNull(kColYear, SqlFieldType::INTEGER));
+    for (const char* month : kColMonths) {
         AddField(Nullable(month, SqlFieldType::TEXT));
     }
 }
 
-RawEventTable::RawEventTable() : BaseTable(TBL_RAW_EVENTS) {
+RawEventTable::RawEventTable() : BaseTable(kTblRawEvents) {
     AddField(KeyField());
-    AddField(NotNull(COL_EVENT_ID, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_EXTRA_DATA, SqlFieldType::TEXT));
-    AddField(NotNull(COL_TIMESTAMP, SqlFieldType::INTEGER));
-    AddField(Nullable(COL_PARAM_LIST, SqlFieldType::TEXT));
+    AddField(NotNull(kColEventId, SqlFieldType::INTEGER));
+    AddField(Nullable(kColExtraData, SqlFieldType::TEXT));
+    AddField(NotNull(kColTimestamp, SqlFieldType::INTEGER));
+    AddField(Nullable(kColParamList, SqlFieldType::TEXT));
 }
 
 }  // namespace Orvane

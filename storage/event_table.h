@@ -8,46 +8,46 @@ namespace Orvane {
 
 // Table and column names of the event database; every statement of the storage code refers
 // to columns through these.
-inline constexpr char TBL_EVENT_INFO[] = "event_info";
-inline constexpr char TBL_EVENT_DAILY[] = "event_daily";
-inline constexpr char TBL_VERSION[] = "version";
-inline constexpr char TBL_DB_VERSION[] = "db_version";
-inline constexpr char TBL_UPLOAD[] = "upload";
-inline constexpr char TBL_RAW_EVENTS[] = "raw_events";
+inline constexpr char kTblEventInfo[] = "event_info";
+inline constexpr char kTblEventDaily[] = "event_daily";
+inline constexpr char kTblVersion[] = "version";
+inline constexpr char kTblDbVersion[] = "db_version";
+inline constexpr char kTblUpload[] = "upload";
+inline constexpr char kTblRawEvents[] = "raw_events";
 
-inline constexpr char COL_ID[] = "id";
-inline constexpr char COL_EVENT_ID[] = "event_id";
+inline constexpr char kColId[] = "id";
+inline constexpr char kColEventId[] = "event_id";
 // event_info
-inline constexpr char COL_TRACE_ID[] = "trace_id";
-inline constexpr char COL_PSPAN_ID[] = "pspan_id";
-inline constexpr char COL_SPAN_ID[] = "span_id";
-inline constexpr char COL_VERSION_ID[] = "version_id";
-inline constexpr char COL_OCCURED_CNT[] = "occured_cnt";
-inline constexpr char COL_FIRST_TIME[] = "first_time";
-inline constexpr char COL_PARAM_LIST[] = "param_list";
-inline constexpr char COL_EXPIRE[] = "expire";
-inline constexpr char COL_VISIBLE[] = "visible";
+inline constexpr char kColTraceId[] = "trace_id";
+inline constexpr char kColPspanId[] = "pspan_id";
+inline constexpr char kColSpanId[] = "span_id";
+inline constexpr char kColVersionId[] = "version_id";
+inline constexpr char kColOccuredCnt[] = "occured_cnt";
+inline constexpr char kColFirstTime[] = "first_time";
+inline constexpr char kColParamList[] = "param_list";
+inline constexpr char kColExpire[] = "expire";
+inline constexpr char kColVisible[] = "visible";
 // event_daily
-inline constexpr char COL_DAILY_CNT[] = "daily_cnt";
-inline constexpr char COL_OVER_CNT[] = "over_cnt";
-inline constexpr char COL_HOUR_CNT[] = "hour_cnt";
-inline constexpr char COL_NEXT_EXPIRE_TIME[] = "next_expire_time";
-inline constexpr char COL_LAST_HAPPEN_TIME[] = "last_happen_time";
-inline constexpr char COL_LAST_LOG_TIME[] = "last_log_time";
+inline constexpr char kColDailyCnt[] = "daily_cnt";
+inline constexpr char kColOverCnt[] = "over_cnt";
+inline constexpr char kColHourCnt[] = "hour_cnt";
+inline constexpr char kColNextExpireTime[] = "next_expire_time";
+inline constexpr char kColLastHappenTime[] = "last_happen_time";
+inline constexpr char kColLastLogTime[] = "last_log_time";
 // version
-inline constexpr char COL_VERSION[] = "version";
+inline constexpr char kColVersion[] = "version";
 // db_version
-inline constexpr char COL_DB_VERSION[] = "db_version";
-inline constexpr char COL_DEV_VERSION[] = "dev_version";
-inline constexpr char COL_START_TIME[] = "start_time";
-inline constexpr char COL_ACTIVATE_TIME[] = "activate_time";
+inline constexpr char kColDbVersion[] = "db_version";
+inline constexpr char kColDevVersion[] = "dev_version";
+inline constexpr char kColStartTime[] = "start_time";
+inline constexpr char kColActivateTime[] = "activate_time";
 // upload: June to August are spelled with a capital M in existing files.
-inline constexpr char COL_YEAR[] = "year";
-inline constexpr const char* COL_MONTHS[12] = {"m1", "m2", "m3", "m4", "m5", "M6",
+inline constexpr char kColYear[] = "year";
+inline constexpr const char* kColMonths[12] = {"m1", "m2", "m3", "m4",  "m5",  "M6",
                                                "M7", "M8", "m9", "m10", "m11", "m12"};
 // raw_events
-inline constexpr char COL_EXTRA_DATA[] = "extra_data";
-inline constexpr char COL_TIMESTAMP[] = "timestamp";
+inline constexpr char kColExtraData[] = "extra_data";
+inline constexpr char kColTimestamp[] = "timestamp";
 
 // The six tables. Each only names itself and declares its columns in their fixed order.
 class EventTable : public BaseTable {

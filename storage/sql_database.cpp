@@ -10,8 +10,8 @@ namespace android {
 namespace Orvane {
 
 namespace {
-constexpr int64_t SOFT_HEAP_LIMIT = 102400;
-constexpr mode_t DB_FILE_MODE = 0640;
+constexpr int64_t kSoftHeapLimit = 102400;
+constexpr mode_t kDbFileMode = 0640;
 
 const char* TypeWord(SqlFieldType type) {
     switch (type) {
@@ -139,7 +139,7 @@ bool SqlDatabase::Open() {
     Close();
     // Both fail harmlessly once SQLite is initialised; they matter for the first open only.
     sqlite3_config(SQLITE_CONFIG_SMALL_MALLOC, 1);
-    sqlite3_soft_heap_limit64(SOFT_HEAP_LIMIT);
+    sqlite3_soft_heap_limit64(kSoftHeapLimit);
     if (sqlite3_open(path_.c_str(), &handle_) != SQLITE_OK) {
         lastError_ = sqlite3_errmsg(handle_);
         OLOGE("%s failed open db %s, %s", path_.c_str(), lastError_.c_str());
@@ -154,7 +154,7 @@ bool SqlDatabase::Open() {
     if (!Execute("PRAGMA synchronous=1;", false)) {
         OLOGE("%s failed db %s set synchronous, %s", path_.c_str(), lastError_.c_str());
     }
-    FileUtil::ChangeMode(path_, DB_FILE_MODE);
+    FileUtil::ChangeMode(path_, kDbFileMode);
     return true;
 }
 

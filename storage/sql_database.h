@@ -1,12 +1,12 @@
 #ifndef ORVANE_STORAGE_SQL_DATABASE_H
 #define ORVANE_STORAGE_SQL_DATABASE_H
 
-#include <utils/RefBase.h>
-
 #include <cstdint>
 #include <map>
 #include <string>
 #include <vector>
+
+#include <utils/RefBase.h>
 
 struct sqlite3;
 

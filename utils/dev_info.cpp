@@ -23,8 +23,8 @@ std::string DevInfo::GetQuorVersion() {
 }
 
 std::string DevInfo::GetSerinalNo() {
-    static const std::string serial = SysEnv::GetSysProperity("ro.serialno", "unknown");
-    return serial;
+    static const std::string kSerial = SysEnv::GetSysProperity("ro.serialno", "unknown");
+    return kSerial;
 }
 
 std::string DevInfo::GetUploadSwitch() {

@@ -1,10 +1,10 @@
 #ifndef ORVANE_UTILS_JSON_UTIL_H
 #define ORVANE_UTILS_JSON_UTIL_H
 
-#include <json/json.h>
-
 #include <map>
 #include <string>
+
+#include <json/json.h>
 
 namespace android {
 namespace Orvane {

@@ -187,8 +187,7 @@ bool ZipReader::Open(const std::string& path) {
     return true;
 }
 
-bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t bufferSize,
-                            const Consumer& consumer) {
+bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t bufferSize, const Consumer& consumer) {
     if (unzHandle_ == nullptr) {
         return false;
     }

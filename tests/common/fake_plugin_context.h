@@ -15,7 +15,10 @@ class FakePluginContext : public PluginContext {
 public:
     FakePluginContext(const std::string& workDir, const std::string& configDir,
                       std::map<std::string, std::string> devices = {})
-        : workDir_(workDir), configDir_(configDir), devices_(std::move(devices)), sharedLoop_(new EventLoop("plat_shared")) {
+        : workDir_(workDir),
+          configDir_(configDir),
+          devices_(std::move(devices)),
+          sharedLoop_(new EventLoop("plat_shared")) {
         sharedLoop_->StartLoop();
     }
     ~FakePluginContext() override { sharedLoop_->StopLoop(); }

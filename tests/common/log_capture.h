@@ -1,11 +1,11 @@
 #ifndef ORVANE_TESTS_COMMON_LOG_CAPTURE_H
 #define ORVANE_TESTS_COMMON_LOG_CAPTURE_H
 
-#include <android/log.h>
-
 #include <chrono>
 #include <string>
 #include <vector>
+
+#include <android/log.h>
 
 namespace android::Orvane {
 

@@ -1,10 +1,10 @@
 #include "config/event_quota_xml_parser.h"
 
-#include <gtest/gtest.h>
-
 #include <filesystem>
 #include <fstream>
 #include <thread>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 

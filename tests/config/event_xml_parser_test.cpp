@@ -1,7 +1,5 @@
 #include "config/event_xml_parser.h"
 
-#include <gtest/gtest.h>
-
 #include <atomic>
 #include <filesystem>
 #include <fstream>
@@ -10,6 +8,8 @@
 #include <regex>
 #include <thread>
 #include <tuple>
+
+#include <gtest/gtest.h>
 
 namespace android::Orvane {
 namespace {
@@ -69,10 +69,11 @@ TEST_F(EventXmlParserTest, EntryAttributesAndExtend) {
     std::string entries;
     for (uint32_t i = 0; i < 4; ++i)
         entries += Entry(910000001 + i, cases[i].first, 0);
-    Write(entries + "  <Event id=\"910000009\">\n"
-                    "    <Param id=\"1\" name=\"pkg\" type=\"string\" len=\"64\" PrivacyLevel=\"L1\" defVal=\"0\"/>\n"
-                    "    <Param id=\"2\" name=\"info\" type=\"class\" classID=\"901001002\" arrLen=\"8\"/>\n"
-                    "    <Param id=\"3\" name=\"ratio\" type=\"double\" PrivacyLevel=\"L9\"/>\n  </Event>\n");
+    Write(entries +
+          "  <Event id=\"910000009\">\n"
+          "    <Param id=\"1\" name=\"pkg\" type=\"string\" len=\"64\" PrivacyLevel=\"L1\" defVal=\"0\"/>\n"
+          "    <Param id=\"2\" name=\"info\" type=\"class\" classID=\"901001002\" arrLen=\"8\"/>\n"
+          "    <Param id=\"3\" name=\"ratio\" type=\"double\" PrivacyLevel=\"L9\"/>\n  </Event>\n");
     sp<EventInfoConfig> withParams = Get(910000009);
     ASSERT_TRUE(withParams != nullptr && withParams->params.size() == 3u);
     const std::vector<EventParamInfoCfg>& p = withParams->params;
@@ -127,7 +128,8 @@ TEST_F(EventXmlParserTest, AttributeScannerAgreesWithThePattern) {
     std::mt19937 random(7);  // short random texts of the characters that matter
     for (int round = 0; round < 5000; ++round) {
         std::string text(random() % 24, ' ');
-        for (char& c : text) c = "ab=\"\" \n\t>"[random() % 9];
+        for (char& c : text)
+            c = "ab=\"\" \n\t>"[random() % 9];
         std::map<std::string, std::string> pairs;
         for (std::sregex_iterator it(text.begin(), text.end(), pattern), end; it != end; ++it)
             pairs[(*it)[1]] = (*it)[2];

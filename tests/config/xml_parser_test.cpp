@@ -1,9 +1,9 @@
 #include "config/xml_parser.h"
 
-#include <gtest/gtest.h>
-
 #include <filesystem>
 #include <fstream>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "utils/zip_pack.h"

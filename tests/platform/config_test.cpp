@@ -1,9 +1,10 @@
 #include "platform/config.h"
 
-#include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <fstream>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 
@@ -19,10 +20,11 @@ std::string Write(const std::string& content) {
 
 TEST(ConfigTest, ParsesSectionsInAnyOrderWithBlanksAndCrLfAndAcceptsAShortSection) {
     LogCapture capture;
-    Config config(Write("plugins:3\r\nSource[thread:source_loop]:0 static\r\n\n"
-                        "   Privacy[thread:privacy_loop]:0 static   \nPerf[]:30 dynamic\n"
-                        "pipelines:1\nfault: Privacy  Perf\npipelinetriggers : 1\nSource: fault\n"
-                        "plugins:5\nLate[thread:late_loop]:5 static trailing words\n"));
+    Config config(
+            Write("plugins:3\r\nSource[thread:source_loop]:0 static\r\n\n"
+                  "   Privacy[thread:privacy_loop]:0 static   \nPerf[]:30 dynamic\n"
+                  "pipelines:1\nfault: Privacy  Perf\npipelinetriggers : 1\nSource: fault\n"
+                  "plugins:5\nLate[thread:late_loop]:5 static trailing words\n"));
     ASSERT_TRUE(config.Parse()) << capture.Dump();
     const auto& plugins = config.GetPluginInfoList();
     ASSERT_EQ(plugins.size(), 4u);
@@ -38,7 +40,8 @@ TEST(ConfigTest, ParsesSectionsInAnyOrderWithBlanksAndCrLfAndAcceptsAShortSectio
 
 TEST(ConfigTest, EachRejectionFailsTheParseWithItsLogLine) {
     std::string garbage;
-    for (int i = 0; i < 4096; i++) garbage += static_cast<char>((i * 7919) % 256);
+    for (int i = 0; i < 4096; i++)
+        garbage += static_cast<char>((i * 7919) % 256);
     // Huge lines are refused before any regular expression sees them.
     const std::string huge(100000, 'x');
     const std::string head = "plugins:1\nA[]:0 static\npipelines:1\n";
@@ -50,10 +53,13 @@ TEST(ConfigTest, EachRejectionFailsTheParseWithItsLogLine) {
             {"plugins:2\nA[]:0 static\nB[]:0 static\nC[]:0 static\n", ANDROID_LOG_ERROR, "Parse match field failed"},
             {garbage, ANDROID_LOG_ERROR, "Parse match field failed"},
             {std::string(10 * 1024 * 1024, 'a'), ANDROID_LOG_ERROR, "too large"},
-            {"plugins:1\nA[thread:]:0 static\n", ANDROID_LOG_WARN, "ParsePlugin plugin A thread type thread or name  invalid"},
-            {"plugins:1\nA[process:loop]:0 static\n", ANDROID_LOG_WARN, "ParsePlugin plugin A thread type process invalid"},
+            {"plugins:1\nA[thread:]:0 static\n", ANDROID_LOG_WARN,
+             "ParsePlugin plugin A thread type thread or name  invalid"},
+            {"plugins:1\nA[process:loop]:0 static\n", ANDROID_LOG_WARN,
+             "ParsePlugin plugin A thread type process invalid"},
             {"plugins:1\nA[]:99999999999 static\n", ANDROID_LOG_WARN, "ParsePlugin no match plugin expression found"},
-            {"plugins:1\n" + huge + "[thread:a]:0 static\n", ANDROID_LOG_WARN, "ParsePlugin no match plugin expression found"},
+            {"plugins:1\n" + huge + "[thread:a]:0 static\n", ANDROID_LOG_WARN,
+             "ParsePlugin no match plugin expression found"},
             {"plugins:2\nA[]:0 static\nA[thread:y]:0 static\n", ANDROID_LOG_WARN, "ParsePlugin redefine plugin A"},
             {head + "p: A B\n", ANDROID_LOG_WARN, "ParsePipeline pipeline p include undefine plugin B"},
             {head + "no colon here\n", ANDROID_LOG_WARN, "ParsePipeline Fail to match pipeline expression"},
@@ -61,7 +67,8 @@ TEST(ConfigTest, EachRejectionFailsTheParseWithItsLogLine) {
             {head + "p: A " + std::string(900, 'y') + "\n", ANDROID_LOG_WARN, "include undefine plugin yyy"},
             {head + "p:A\npipelinetriggers:1\nA\n", ANDROID_LOG_WARN,
              "ParsePipelineTrigger Fail to match pipeline trigger expression"},
-            {head + "p:A\npipelinetriggers:1\nB: p\n", ANDROID_LOG_ERROR, "ParsePipelineTrigger B not define in plugins"},
+            {head + "p:A\npipelinetriggers:1\nB: p\n", ANDROID_LOG_ERROR,
+             "ParsePipelineTrigger B not define in plugins"},
             {head + "p:A\npipelinetriggers:1\nA: p q\n", ANDROID_LOG_WARN,
              "ParsePipelineTrigger pipelinetriggers A include undefine pipeline q"},
     };

@@ -20,22 +20,22 @@ struct CallbackHandler : EventHandler {
 
 class EventLoopTest : public ::testing::Test {
 protected:
-    void SetUp() override { loop->StartLoop(); }
+    void SetUp() override { loop_->StartLoop(); }
     // The loop thread's kernel id; every entry due before this call has run when it returns.
     pid_t Drain() {
         auto tid = std::make_shared<std::atomic<pid_t>>(0);
-        loop->AddTask([tid] { *tid = static_cast<pid_t>(syscall(SYS_gettid)); });
+        loop_->AddTask([tid] { *tid = static_cast<pid_t>(syscall(SYS_gettid)); });
         EXPECT_TRUE(WaitUntil([&] { return *tid != 0; }, std::chrono::seconds(60)));
         return *tid;
     }
     // Queues a new event for `handler`; the returned reference empties once the event is released.
     wp<Event> Queue(const sp<EventHandler>& handler, unsigned long delaySeconds = 0) {
         sp<Event> event = new Event("test");
-        loop->AddEvent(handler, event, delaySeconds);
+        loop_->AddEvent(handler, event, delaySeconds);
         return event;
     }
 
-    sp<EventLoop> loop = new EventLoop("test_loop");
+    sp<EventLoop> loop_ = new EventLoop("test_loop");
 };
 
 TEST_F(EventLoopTest, EntriesFromConcurrentProducersRunOnceEachOneAtATimeInDueOrder) {
@@ -43,20 +43,23 @@ TEST_F(EventLoopTest, EntriesFromConcurrentProducersRunOnceEachOneAtATimeInDueOr
     std::vector<std::atomic<int>> runs(kThreads * kPerThread);
     std::vector<int> delays;  // only the loop's thread touches it
     Gate gate;
-    loop->AddTask([&gate] { gate.Wait(); });  // due first, so it holds the loop from the start
+    loop_->AddTask([&gate] { gate.Wait(); });  // due first, so it holds the loop from the start
     // Queued in mixed order while the loop is busy: the due time alone decides.
     std::vector<std::thread> producers;
     for (int t = 0; t < kThreads; t++) {
         producers.emplace_back([&, t] {
             for (int index = t * kPerThread; index < (t + 1) * kPerThread; index++) {
-                loop->AddTask([&, index] {
-                    runs[index]++;
-                    delays.push_back(index % 3);
-                }, index % 3);
+                loop_->AddTask(
+                        [&, index] {
+                            runs[index]++;
+                            delays.push_back(index % 3);
+                        },
+                        index % 3);
             }
         });
     }
-    for (auto& producer : producers) producer.join();
+    for (auto& producer : producers)
+        producer.join();
     gate.Open();
     ASSERT_TRUE(WaitUntil([&] { return std::count(runs.begin(), runs.end(), 1) == kThreads * kPerThread; }));
     Drain();
@@ -67,8 +70,13 @@ TEST_F(EventLoopTest, RepeatingTaskDriftsByItsRunTimeAndZeroIntervalRunsOnce) {
     Journal starts;
     std::atomic<int> zeroRepeats{0};
     // The task's own run time of 200 ms adds to its period.
-    loop->AddTask([&starts] { starts.Add("run"); std::this_thread::sleep_for(milliseconds(200)); }, 1, true);
-    loop->AddTask([&zeroRepeats] { zeroRepeats++; }, 0, true);
+    loop_->AddTask(
+            [&starts] {
+                starts.Add("run");
+                std::this_thread::sleep_for(milliseconds(200));
+            },
+            1, true);
+    loop_->AddTask([&zeroRepeats] { zeroRepeats++; }, 0, true);
     ASSERT_TRUE(starts.WaitForSize(3));
     Drain();
     EXPECT_EQ(zeroRepeats, 1);
@@ -90,11 +98,11 @@ TEST_F(EventLoopTest, WaitResultBlocksUntilRunAndFailsOnlyOnMinusOne) {
     for (EVENT_RET ret : {0, -1, 1, 7, -2}) {
         next = ret;
         int before = runs;
-        EXPECT_EQ(loop->AddEventWaitResult(handler, event), ret != -1) << ret;
+        EXPECT_EQ(loop_->AddEventWaitResult(handler, event), ret != -1) << ret;
         EXPECT_EQ(runs, before + 1) << "returned before the handler ran on the loop, result " << ret;
     }
-    EXPECT_FALSE(loop->AddEventWaitResult(nullptr, event));
-    EXPECT_EQ(loop->AddEvent(handler, nullptr), UINT64_MAX);
+    EXPECT_FALSE(loop_->AddEventWaitResult(nullptr, event));
+    EXPECT_EQ(loop_->AddEvent(handler, nullptr), UINT64_MAX);
 }
 
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
@@ -108,15 +116,15 @@ TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDest
         std::getline(std::ifstream(stat), line);
         return line.find(") S ") != std::string::npos;
     }));
-    loop->AddTask([&ran] { ran++; });
+    loop_->AddTask([&ran] { ran++; });
     EXPECT_TRUE(WaitUntil([&ran] { return ran == 1; }, std::chrono::seconds(5)));
-    loop->StopLoop();
+    loop_->StopLoop();
     // The thread is gone, so nothing queued from now on can run.
     EXPECT_TRUE(WaitUntil([&] { return !std::ifstream(stat).good(); }));
     wp<Event> late = Queue(handler);
-    loop->AddTask([&ran] { ran++; });
+    loop_->AddTask([&ran] { ran++; });
     EXPECT_TRUE(queued.promote() != nullptr && late.promote() != nullptr);
-    loop = nullptr;
+    loop_ = nullptr;
     EXPECT_TRUE(queued.promote() == nullptr && late.promote() == nullptr);
     EXPECT_TRUE(ran == 1 && handler->getStrongCount() == 1) << ran << " runs, " << handler->getStrongCount() << " refs";
 }
@@ -124,13 +132,13 @@ TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDest
 TEST_F(EventLoopTest, LoopReleasedByItsOwnEntryShutsDownCleanly) {
     wp<Event> queued = Queue(new EventHandler(), 30);
     Gate gate;
-    loop->AddTask([&gate] { gate.Wait(); });  // due first, so it holds the loop from the start
+    loop_->AddTask([&gate] { gate.Wait(); });  // due first, so it holds the loop from the start
     std::atomic<bool> released{false};
-    loop->AddTask([self = loop, &released]() mutable {
+    loop_->AddTask([self = loop_, &released]() mutable {
         self = nullptr;
         released = true;  // orders the gate's end after its last use, where TSan can see it
     });
-    loop = nullptr;  // the task now holds the only reference
+    loop_ = nullptr;  // the task now holds the only reference
     gate.Open();
     EXPECT_TRUE(WaitUntil([&] { return released && queued.promote() == nullptr; }));
 }

@@ -16,7 +16,12 @@ TEST(EventThreadPoolTest, TasksRunByPriorityThenDueTimeSurviveThrowsAndStopDrops
     pool->AddTask(task("delayed-p0"), "e", 1, 0);
     ASSERT_TRUE(pool->Start());
     std::atomic<bool> held{false};
-    pool->AddTask([&] { held = true; gate.Wait(); }, "block", 0, 0);
+    pool->AddTask(
+            [&] {
+                held = true;
+                gate.Wait();
+            },
+            "block", 0, 0);
     ASSERT_TRUE(WaitUntil([&] { return held.load(); }));
     // Queued while the only thread is held: priority first, then insertion (due) order.
     pool->AddTask(task("p5-first"), "a", 0, 5);
@@ -31,12 +36,20 @@ TEST(EventThreadPoolTest, TasksRunByPriorityThenDueTimeSurviveThrowsAndStopDrops
 
     // Stop waits for the running task, drops the pending ones and refuses new ones.
     std::atomic<int> finished{0};
-    pool->AddTask([&] { running.Wait(); finished++; }, "running", 0, 0);
+    pool->AddTask(
+            [&] {
+                running.Wait();
+                finished++;
+            },
+            "running", 0, 0);
     ASSERT_TRUE(WaitUntil([&] { return pool->GetPendingCount() == 0; }));  // the thread holds it
     pool->AddTask([&] { finished += 10; }, "pending", 0, 0);
     pool->AddTask([&] { finished += 10; }, "later", 1, 0);
     // Opened once Stop has emptied the queues; Stop must then still wait for the running task.
-    std::thread opener([&] { WaitUntil([&] { return pool->GetPendingCount() == 0; }); running.Open(); });
+    std::thread opener([&] {
+        WaitUntil([&] { return pool->GetPendingCount() == 0; });
+        running.Open();
+    });
     pool->Stop();
     opener.join();
     EXPECT_EQ(finished.load(), 1);

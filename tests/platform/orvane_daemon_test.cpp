@@ -1,12 +1,13 @@
 // Runs the daemon binary as processes: one instance per work folder, and a restart after the
 // running one was killed.
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <fstream>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
@@ -27,7 +28,8 @@ protected:
     }
     void TearDown() override {
         for (pid_t pid : started_) {
-            if (waitpid(pid, nullptr, WNOHANG) == 0 && kill(pid, SIGKILL) == 0) waitpid(pid, nullptr, 0);  // still ours
+            if (waitpid(pid, nullptr, WNOHANG) == 0 && kill(pid, SIGKILL) == 0)
+                waitpid(pid, nullptr, 0);  // still ours
         }
         system(("rm -rf " + root_).c_str());
     }

@@ -7,7 +7,9 @@ namespace android::Orvane {
 // Records its step and returns a fixed result.
 struct StepPlugin : Plugin {
     StepPlugin(const std::string& name, Journal& journal, EVENT_RET result = 0, bool accepts = true)
-        : journal(journal), result(result), accepts(accepts) { SetName(name); }
+        : journal(journal), result(result), accepts(accepts) {
+        SetName(name);
+    }
     EVENT_RET OnEvent(sp<Event>&) override {
         journal.Add(GetName());
         return result;
@@ -47,9 +49,9 @@ TEST(PipelineTest, ResultsStopThePipelineAndDecideOnListeners) {
     };
     for (const auto& c : cases) {
         Journal journal;
-        sp<Pipeline> pipeline = new Pipeline("results", {new StepPlugin("P0", journal, c.results[0]),
-                                                         new StepPlugin("P1", journal, c.results[1]),
-                                                         new StepPlugin("P2", journal, c.results[2])});
+        sp<Pipeline> pipeline = new Pipeline(
+                "results", {new StepPlugin("P0", journal, c.results[0]), new StepPlugin("P1", journal, c.results[1]),
+                            new StepPlugin("P2", journal, c.results[2])});
         sp<Plugin> listener = new StepPlugin("L", journal);
         pipeline->RegisterPluginListener(listener);
         pipeline->RegisterPluginListener(listener);  // told once
@@ -63,8 +65,10 @@ TEST(PipelineTest, SameLoopStepsRunInOneTaskOtherStepsAndListenersOnTheirLoops) 
     sp<EventLoop> loops[] = {new EventLoop("same_loop"), new EventLoop("next_loop"), new EventLoop("listen_loop")};
     sp<StepPlugin> steps[] = {new StepPlugin("A", journal), new StepPlugin("B", journal), new StepPlugin("C", journal),
                               new StepPlugin("LoopListener", journal)};
-    for (const auto& loop : loops) loop->StartLoop();
-    for (int i = 0; i < 4; i++) steps[i]->SetLooper(loops[i < 2 ? 0 : i - 1]);
+    for (const auto& loop : loops)
+        loop->StartLoop();
+    for (int i = 0; i < 4; i++)
+        steps[i]->SetLooper(loops[i < 2 ? 0 : i - 1]);
     sp<Pipeline> pipeline = new Pipeline("same", {steps[0], steps[1], steps[2]});
     pipeline->RegisterPluginListener(steps[3]);
     pipeline->RegisterPluginListener(new StepPlugin("DirectListener", journal));

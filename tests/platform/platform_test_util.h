@@ -1,12 +1,12 @@
 // Helpers of the platform tests that run plugins on loops.
 #pragma once
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
 #include <future>
 #include <mutex>
 #include <thread>
+
+#include <gtest/gtest.h>
 
 #include "platform/event_loop.h"
 #include "tests/common/log_capture.h"
@@ -16,7 +16,11 @@ namespace android::Orvane {
 // What ran, in order, on which thread and when. Safe from any thread.
 class Journal {
 public:
-    struct Record { std::string what; std::thread::id thread; std::chrono::steady_clock::time_point when; };
+    struct Record {
+        std::string what;
+        std::thread::id thread;
+        std::chrono::steady_clock::time_point when;
+    };
     void Add(const std::string& what) {
         std::lock_guard<std::mutex> lock(mutex_);
         records_.push_back({what, std::this_thread::get_id(), std::chrono::steady_clock::now()});
@@ -27,7 +31,8 @@ public:
     }
     std::vector<std::string> Entries() {
         std::vector<std::string> entries;
-        for (const auto& record : Records()) entries.push_back(record.what);
+        for (const auto& record : Records())
+            entries.push_back(record.what);
         return entries;
     }
     // The first record of `what`; one with an empty `what` when there is none.
@@ -36,8 +41,12 @@ public:
         auto it = std::find_if(records.begin(), records.end(), [&](const Record& r) { return r.what == what; });
         return it == records.end() ? Record() : *it;
     }
-    bool WaitFor(const std::string& what) { return WaitUntil([&] { return !Find(what).what.empty(); }); }
-    bool WaitForSize(size_t size) { return WaitUntil([&] { return Records().size() >= size; }); }
+    bool WaitFor(const std::string& what) {
+        return WaitUntil([&] { return !Find(what).what.empty(); });
+    }
+    bool WaitForSize(size_t size) {
+        return WaitUntil([&] { return Records().size() >= size; });
+    }
 
 private:
     std::mutex mutex_;

@@ -57,7 +57,8 @@ protected:
     std::unique_ptr<PluginPlatform> NewPlatform(std::vector<std::string> args = {}) {
         args.insert(args.begin(), {"orvane", "-configDir", etc_, "-workDir", root_ + "/work", "-cloudCfgDir", cloud_});
         std::vector<char*> argv;
-        for (auto& arg : args) argv.push_back(&arg[0]);
+        for (auto& arg : args)
+            argv.push_back(&arg[0]);
         auto platform = std::make_unique<PluginPlatform>();
         EXPECT_EQ(platform->ParseArgs(static_cast<int>(argv.size()), argv.data()), 0);
         return platform;
@@ -69,12 +70,23 @@ protected:
 TEST_F(PluginPlatformTest, ParseArgsNormalisesFoldersAndRefusesUnknownOptions) {
     LogCapture capture;
     PluginPlatform platform;
-    const char* args[] = {"orvane", "-configDir", "etc/orvane", "-workDir", "///data/x///", "-cloudCfgDir", "/cloud",
-                          "-configName", "  my_config  ", "-devList", "qxev=/tmp/qxev,broken,=/nothing,empty=", "-region"};
+    const char* args[] = {"orvane",
+                          "-configDir",
+                          "etc/orvane",
+                          "-workDir",
+                          "///data/x///",
+                          "-cloudCfgDir",
+                          "/cloud",
+                          "-configName",
+                          "  my_config  ",
+                          "-devList",
+                          "qxev=/tmp/qxev,broken,=/nothing,empty=",
+                          "-region"};
     EXPECT_EQ(platform.ParseArgs(12, const_cast<char**>(args)), 0);
     EXPECT_EQ(platform.GetConfigDir() + platform.GetWorkDir() + platform.GetCloudConfigDir() + platform.GetConfigName(),
               "/etc/orvane//data/x//cloud/my_config");
-    EXPECT_EQ(platform.GetDevicePath("qxev", "/dev/qxev") + platform.GetDevicePath("empty", "/dev/empty"), "/tmp/qxev/dev/empty");
+    EXPECT_EQ(platform.GetDevicePath("qxev", "/dev/qxev") + platform.GetDevicePath("empty", "/dev/empty"),
+              "/tmp/qxev/dev/empty");
     EXPECT_EQ(capture.Count(ANDROID_LOG_WARN, "ParseDevList ignore malformed device entry"), 3u);
     const char* bad[] = {"orvane", "-workDir", "/w", "-bogus", "x"};
     EXPECT_EQ(PluginPlatform().ParseArgs(5, const_cast<char**>(bad)), -1);

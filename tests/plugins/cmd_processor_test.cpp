@@ -1,6 +1,5 @@
 #include "plugins/cmd_processor.h"
 
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <stdio.h>
 #include <sys/stat.h>
@@ -9,6 +8,8 @@
 #include <algorithm>
 #include <atomic>
 #include <thread>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
@@ -44,11 +45,13 @@ protected:
 
 TEST_F(CmdProcessorTest, OutputAndExitCodesOfFinishedCommands) {
     std::string selfKill = WriteScript("echo before\nkill -9 $$");
-    struct { std::string command, output, logged; } cases[] = {
-        {"echo hello  world", "hello  world\n", ""},  // two blanks: an empty word between
-        {"false", "", "command 'false' failed: exit code 1"},
-        {selfKill, "before\n", "command '" + selfKill + "' failed: killed by signal 9"},
-        {"/nonexistent/program --flag", "", "command '/nonexistent/program --flag' failed: exit code 1"},
+    struct {
+        std::string command, output, logged;
+    } cases[] = {
+            {"echo hello  world", "hello  world\n", ""},  // two blanks: an empty word between
+            {"false", "", "command 'false' failed: exit code 1"},
+            {selfKill, "before\n", "command '" + selfKill + "' failed: killed by signal 9"},
+            {"/nonexistent/program --flag", "", "command '/nonexistent/program --flag' failed: exit code 1"},
     };
     LogCapture log;
     for (const auto& c : cases) {
@@ -68,7 +71,10 @@ TEST_F(CmdProcessorTest, OutputAndExitCodesOfFinishedCommands) {
 
 TEST_F(CmdProcessorTest, OverrunIsTerminatedThenKilled) {
     // An ignored SIGTERM survives exec: that sleep shrugs it off and needs SIGKILL after the grace.
-    struct { std::string body; seconds atLeast; } cases[] = {{"echo started\nexec sleep 60", seconds(0)},
+    struct {
+        std::string body;
+        seconds atLeast;
+    } cases[] = {{"echo started\nexec sleep 60", seconds(0)},
                  {"echo started\ntrap '' TERM\nexec sleep 60", seconds(5)}};
     for (const auto& c : cases) {
         SCOPED_TRACE(c.body);
@@ -78,7 +84,8 @@ TEST_F(CmdProcessorTest, OverrunIsTerminatedThenKilled) {
         EXPECT_EQ("started\n", Run(script, 1));
         EXPECT_GE(Clock::now() - start, c.atLeast);
         EXPECT_LT(Clock::now() - start, seconds(30));
-        EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "ToFileWithTimeout command '" + script + "' timed out, (killing pid"));
+        EXPECT_TRUE(
+                log.Contains(ANDROID_LOG_INFO, "ToFileWithTimeout command '" + script + "' timed out, (killing pid"));
         EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, "even with SIGKILL"));
     }
 }
@@ -92,7 +99,11 @@ TEST_F(CmdProcessorTest, ReapsAtOnceWithSigchldBlockedInEveryThread) {
     ASSERT_EQ(pthread_sigmask(SIG_BLOCK, &childSignal, &oldMask), 0);
     std::atomic<bool> stop{false};
     std::vector<std::thread> busy(3);
-    for (auto& thread : busy) thread = std::thread([&stop] { while (!stop) std::this_thread::yield(); });
+    for (auto& thread : busy)
+        thread = std::thread([&stop] {
+            while (!stop)
+                std::this_thread::yield();
+        });
     LogCapture log;
     std::string line;
     ASSERT_TRUE(CmdProcessor::GetCommandResult("echo pending", line));  // leaves a SIGCHLD pending
@@ -104,20 +115,25 @@ TEST_F(CmdProcessorTest, ReapsAtOnceWithSigchldBlockedInEveryThread) {
     // The command starts with nothing blocked.
     std::string mask = Run("grep SigBlk /proc/self/status", 30);
     EXPECT_NE(mask.find("SigBlk:\t0000000000000000"), std::string::npos) << mask;
-    for (const char* bad : {"timed out", "instead", "Error"}) EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, bad)) << bad;
+    for (const char* bad : {"timed out", "instead", "Error"})
+        EXPECT_FALSE(log.Contains(ANDROID_LOG_INFO, bad)) << bad;
     stop = true;
-    for (auto& thread : busy) thread.join();
+    for (auto& thread : busy)
+        thread.join();
     pthread_sigmask(SIG_SETMASK, &oldMask, nullptr);
 }
 
 TEST_F(CmdProcessorTest, WaitPidTimesOutWithEtimedoutAndProcessNameIsItsCmdline) {
     pid_t child = fork();
-    if (child == 0) _exit(execlp("sleep", "sleep", "30", static_cast<char*>(nullptr)));
+    if (child == 0)
+        _exit(execlp("sleep", "sleep", "30", static_cast<char*>(nullptr)));
     ASSERT_GT(child, 0);
     errno = 0;
     EXPECT_FALSE(CmdProcessor::WaitPidWithTimeout(child, 1, nullptr));
     EXPECT_EQ(errno, ETIMEDOUT);
-    EXPECT_EQ(CmdProcessor::GetProcNameByPid(child), std::string("sleep\0" "30", 8));
+    EXPECT_EQ(CmdProcessor::GetProcNameByPid(child), std::string("sleep\0"
+                                                                 "30",
+                                                                 8));
     kill(child, SIGKILL);
     int status = 0;
     EXPECT_TRUE(CmdProcessor::WaitPidWithTimeout(child, 10, &status));
@@ -129,10 +145,10 @@ TEST_F(CmdProcessorTest, WaitPidTimesOutWithEtimedoutAndProcessNameIsItsCmdline)
 TEST_F(CmdProcessorTest, FirstLineOfShellOutput) {
     std::string result = "previous";
     const std::pair<std::string, std::string> cases[] = {
-        {"printf 'one\\ntwo\\nthree\\n'", "one\n"},
-        {"printf 'no line end'", "no line end"},
-        {"true", "no line end"},  // no output keeps the old value
-        {"printf '" + std::string(600, 'x') + "'", std::string(511, 'x')},
+            {"printf 'one\\ntwo\\nthree\\n'", "one\n"},
+            {"printf 'no line end'", "no line end"},
+            {"true", "no line end"},  // no output keeps the old value
+            {"printf '" + std::string(600, 'x') + "'", std::string(511, 'x')},
     };
     for (const auto& c : cases) {
         EXPECT_TRUE(CmdProcessor::GetCommandResult(c.first, result));

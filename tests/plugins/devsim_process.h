@@ -26,18 +26,18 @@ public:
             *failure = "cannot create a mount folder or a pipe";
             return false;
         }
-        folder = mountAt != nullptr ? mountAt : folderTemplate;
+        folder_ = mountAt != nullptr ? mountAt : folderTemplate;
         std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane-devsim";
-        pid = fork();
-        if (pid == 0) {
+        pid_ = fork();
+        if (pid_ == 0) {
             prctl(PR_SET_PDEATHSIG, SIGTERM);  // a crashed test leaves no mount behind
             dup2(errPipe[1], STDERR_FILENO);
-            execl(program.c_str(), program.c_str(), folder.c_str(), static_cast<char*>(nullptr));
+            execl(program.c_str(), program.c_str(), folder_.c_str(), static_cast<char*>(nullptr));
             _exit(127);
         }
         close(errPipe[1]);
         auto mounted = [this] { return access(Path("qxev").c_str(), F_OK) == 0; };
-        WaitUntil([&] { return mounted() || waitpid(pid, nullptr, WNOHANG) == pid; });
+        WaitUntil([&] { return mounted() || waitpid(pid_, nullptr, WNOHANG) == pid_; });
         bool ok = mounted();
         if (!ok) {
             char reason[512] = {};
@@ -51,7 +51,7 @@ public:
     }
     ~DevSim() { Stop(); }
 
-    std::string Path(const std::string& node) const { return folder + "/" + node; }
+    std::string Path(const std::string& node) const { return folder_ + "/" + node; }
 
     // One write, one record, as a driver queues it.
     bool Inject(const std::string& node, const std::string& record) const {
@@ -63,20 +63,20 @@ public:
 
     // Unmounts; readers still blocked on a node then see their read fail.
     void Stop() {
-        if (pid > 0) {
-            kill(pid, SIGTERM);
-            waitpid(pid, nullptr, 0);
-            pid = -1;
+        if (pid_ > 0) {
+            kill(pid_, SIGTERM);
+            waitpid(pid_, nullptr, 0);
+            pid_ = -1;
         }
-        if (!folder.empty()) {
-            rmdir(folder.c_str());
-            folder.clear();
+        if (!folder_.empty()) {
+            rmdir(folder_.c_str());
+            folder_.clear();
         }
     }
 
 private:
-    std::string folder;
-    pid_t pid = -1;
+    std::string folder_;
+    pid_t pid_ = -1;
 };
 
 }  // namespace android::Orvane

@@ -48,7 +48,7 @@ TEST(EventLogrelaySourceTest, MissingOrUnpollableNodeEndsOnlyThisSourceWithOneLi
     }
     unlink(plain.c_str());
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR, "openExceptionLogFd No kernel exception log monitor support (errno=2)"))
-        << logs.Dump();
+            << logs.Dump();
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR,
                              "registerExceptionLogMonitor epoll_ctl for exception log monitor failed; errno=1"));
     ASSERT_TRUE(fifo.Write("EventId 901001001 -t 5 -paraList {}"));

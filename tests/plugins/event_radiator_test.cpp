@@ -1,10 +1,10 @@
 #include "plugins/event_radiator.h"
 
-#include <gtest/gtest.h>
-
 #include <sys/resource.h>
 
 #include <cstdint>
+
+#include <gtest/gtest.h>
 
 #include "platform/plugin_factory.h"
 #include "tests/plugins/event_source_test_util.h"
@@ -38,16 +38,22 @@ TEST(EventRadiatorTest, RecordsBecomeEventsAndBadOnesAreDroppedWithOneLineEach) 
     sp<RecordingPlugin> recorder = AttachRecorder(radiator);
     LogCapture logs;
     const std::string records[] = {
-        "EventId 901001001 -t 1690000000000 -paraList {a:1}",
-        "EventId 901001002 -t 7 -paraList {a: 1, b: 2}\n",  // blanks and line feed belong to the text
-        "EventId 15 -t 7 -paraList 5",  // the first token "5" occurs earlier, in the id "15"
-        // Two records in one read are one record: the second rides in the first one's parameters.
-        "EventId 901001003 -t 8 -paraList {x:1}EventId 901001004 -t 9 -paraList {y:2}",
-        "EventId 3 -t 99999999999999999999999 -paraList {}",  // saturates rather than wrapping
-        // Invalid, one line each:
-        "EventId 0 -t 5 -paraList {}", "EventId -7 -t 5 -paraList {}", "no keywords at all",
-        "EventId 5 -t 7", "EventId 5 -t 7 -paraList ", "EventId x -t 7 -paraList {}",
-        "eventid 5 -t 7 -paraList {}", std::string("\x01\xff\xfe binary\x7f", 12), "",
+            "EventId 901001001 -t 1690000000000 -paraList {a:1}",
+            "EventId 901001002 -t 7 -paraList {a: 1, b: 2}\n",  // blanks and line feed belong to the text
+            "EventId 15 -t 7 -paraList 5",                      // the first token "5" occurs earlier, in the id "15"
+            // Two records in one read are one record: the second rides in the first one's parameters.
+            "EventId 901001003 -t 8 -paraList {x:1}EventId 901001004 -t 9 -paraList {y:2}",
+            "EventId 3 -t 99999999999999999999999 -paraList {}",  // saturates rather than wrapping
+            // Invalid, one line each:
+            "EventId 0 -t 5 -paraList {}",
+            "EventId -7 -t 5 -paraList {}",
+            "no keywords at all",
+            "EventId 5 -t 7",
+            "EventId 5 -t 7 -paraList ",
+            "EventId x -t 7 -paraList {}",
+            "eventid 5 -t 7 -paraList {}",
+            std::string("\x01\xff\xfe binary\x7f", 12),
+            "",
     };
     for (std::string record : records) {
         radiator->ParseEvent(&record[0]);
@@ -74,12 +80,14 @@ TEST(EventRadiatorTest, ReadLoopEndsOnAMissingDeviceSplitsAt4096BytesKeepsOrderA
     if (setrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur > FD_SETSIZE + 16) {
         // With every descriptor select can watch taken, the node's is refused rather than overrun.
         std::vector<int> taken;
-        for (int fd = 0; fd >= 0 && fd < FD_SETSIZE;) taken.push_back(fd = dup(STDERR_FILENO));
+        for (int fd = 0; fd >= 0 && fd < FD_SETSIZE;)
+            taken.push_back(fd = dup(STDERR_FILENO));
         FakePluginContext crowded{"/tmp/", "/tmp/", {{"qxev", fifo.path}}};
         sp<EventRadiator> late = new EventRadiator();
         late->SetPluginContext(&crowded);
         late->StartEventSource();
-        for (int fd : taken) close(fd);
+        for (int fd : taken)
+            close(fd);
         EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "StartEventSource descriptor ")) << logs.Dump();
     }
     sp<EventRadiator> radiator = new EventRadiator();

@@ -24,19 +24,19 @@ namespace android::Orvane {
 class RecordingPlugin : public Plugin {
 public:
     EVENT_RET OnEvent(sp<Event>& event) override {
-        std::lock_guard<std::mutex> guard(lock);
-        events.push_back(event);
+        std::lock_guard<std::mutex> guard(lock_);
+        events_.push_back(event);
         return 0;
     }
     std::vector<sp<Event>> Events() const {
-        std::lock_guard<std::mutex> guard(lock);
-        return events;
+        std::lock_guard<std::mutex> guard(lock_);
+        return events_;
     }
     size_t Count() const { return Events().size(); }
 
 private:
-    mutable std::mutex lock;
-    std::vector<sp<Event>> events;
+    mutable std::mutex lock_;
+    std::vector<sp<Event>> events_;
 };
 
 // Connects a source to a pipeline holding only a new recorder.
@@ -71,37 +71,37 @@ struct PacketFifo {
 // with a signal (installed without SA_RESTART) until it has returned.
 class SourceRunner {
 public:
-    explicit SourceRunner(sp<EventSource> source) : source(source) {
+    explicit SourceRunner(sp<EventSource> source) : source_(source) {
         struct sigaction action = {};
         action.sa_handler = [](int) {};
         sigaction(SIGUSR1, &action, nullptr);
-        thread = std::thread([this] {
-            this->source->StartEventSource();
-            finished = true;
+        thread_ = std::thread([this] {
+            this->source_->StartEventSource();
+            finished_ = true;
         });
     }
     ~SourceRunner() { Stop(); }
 
-    bool Finished() const { return finished; }
+    bool Finished() const { return finished_; }
 
     // Unloads the source and knocks it out of its blocking call; true when it returned.
     bool Stop() {
-        if (!thread.joinable()) {
-            return finished;
+        if (!thread_.joinable()) {
+            return finished_;
         }
-        source->OnUnload();
+        source_->OnUnload();
         bool done = WaitUntil([this] {
-            pthread_kill(thread.native_handle(), SIGUSR1);
-            return WaitUntil([this] { return finished.load(); }, std::chrono::milliseconds(20));
+            pthread_kill(thread_.native_handle(), SIGUSR1);
+            return WaitUntil([this] { return finished_.load(); }, std::chrono::milliseconds(20));
         });
-        done ? thread.join() : thread.detach();  // still blocked: leaking it beats hanging the binary
+        done ? thread_.join() : thread_.detach();  // still blocked: leaking it beats hanging the binary
         return done;
     }
 
 private:
-    sp<EventSource> source;
-    std::atomic<bool> finished{false};
-    std::thread thread;
+    sp<EventSource> source_;
+    std::atomic<bool> finished_{false};
+    std::thread thread_;
 };
 
 }  // namespace android::Orvane

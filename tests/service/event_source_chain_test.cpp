@@ -1,6 +1,5 @@
 // The daemon as a process on emulated device nodes: kernel records end up in event.db, a
 // missing node stops only its own source, and a restart keeps what was stored.
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <spawn.h>
 #include <sqlite3.h>
@@ -9,6 +8,8 @@
 
 #include <filesystem>
 #include <fstream>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "tests/plugins/devsim_process.h"
@@ -23,41 +24,41 @@ class EventSourceChainTest : public ::testing::Test {
 protected:
     void SetUp() override {
         std::string failure;
-        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || !devsim.Start(&failure))
+        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || !devsim_.Start(&failure))
             GTEST_SKIP() << "the daemon or the device emulator is unavailable: " << failure;
-        std::ofstream(folder + "/properties") << "ro.quor.build.region=CN\n";
+        std::ofstream(folder_ + "/properties") << "ro.quor.build.region=CN\n";
     }
     void TearDown() override {
         StopDaemon();
-        std::filesystem::remove_all(folder);
+        std::filesystem::remove_all(folder_);
     }
 
     // Starts the daemon with the shipped configuration. The nodes queue what is written before it reads.
     void StartDaemon(const std::string& devList) {
-        std::string command = "ORVANE_PROPERTY_FILE=" + folder + "/properties exec setpriv --pdeathsig KILL " +
-                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " + folder +
-                              "/work -cloudCfgDir " + folder + "/cloud -devList " + devList + " >" + folder +
+        std::string command = "ORVANE_PROPERTY_FILE=" + folder_ + "/properties exec setpriv --pdeathsig KILL " +
+                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " + folder_ +
+                              "/work -cloudCfgDir " + folder_ + "/cloud -devList " + devList + " >" + folder_ +
                               "/orvane.log 2>&1";
         const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
-        ASSERT_EQ(posix_spawn(&daemon, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
+        ASSERT_EQ(posix_spawn(&daemon_, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
     }
 
     void StopDaemon() {
-        if (daemon > 0 && kill(daemon, SIGTERM) == 0)
-            waitpid(daemon, nullptr, 0);
-        daemon = -1;
+        if (daemon_ > 0 && kill(daemon_, SIGTERM) == 0)
+            waitpid(daemon_, nullptr, 0);
+        daemon_ = -1;
     }
 
     std::string Log() {
         std::string text;
-        FileUtil::LoadStringFromFile(folder + "/orvane.log", text);
+        FileUtil::LoadStringFromFile(folder_ + "/orvane.log", text);
         return text;
     }
 
     // event_info rows of an id, "first_time|occured_cnt|param_list" each by row id. They are read
     // from a copy, as the daemon's writes take no busy time-out.
     std::string Stored(uint32_t eventId) {
-        std::string copy = folder + "/snapshot.db", rows;
+        std::string copy = folder_ + "/snapshot.db", rows;
         std::string sql = "select first_time || '|' || occured_cnt || '|' || param_list from event_info " +
                           ("where event_id = " + std::to_string(eventId)) + " order by id;";
         auto append = [](void* out, int, char** values, char**) {
@@ -65,16 +66,16 @@ protected:
             return 0;
         };
         sqlite3* db = nullptr;
-        if (system(("cp " + folder + "/work/event.db " + copy + " 2>/dev/null").c_str()) == 0 &&
+        if (system(("cp " + folder_ + "/work/event.db " + copy + " 2>/dev/null").c_str()) == 0 &&
             sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK)
             sqlite3_exec(db, sql.c_str(), append, &rows, nullptr);
         sqlite3_close(db);
         return rows;
     }
 
-    DevSim devsim;
-    std::string folder = mkdtemp(std::string("/tmp/orvane-chain-XXXXXX").data());
-    pid_t daemon = -1;
+    DevSim devsim_;
+    std::string folder_ = mkdtemp(std::string("/tmp/orvane-chain-XXXXXX").data());
+    pid_t daemon_ = -1;
 };
 
 // Bad records and a missing node are each source's own concern; here the shipped configuration
@@ -83,9 +84,9 @@ protected:
 TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
     const std::string params = " -paraList {\"device\": \"sda\", \"errno\": 5}";
     const std::string stored = "|{\"device\": \"sda\", \"errno\": 5}\n";
-    StartDaemon("qxev=" + devsim.Path("qxev") + ",qx_exception_log=" + folder + "/no_such_node");
-    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000000" + params));
-    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000100" + params));
+    StartDaemon("qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + folder_ + "/no_such_node");
+    ASSERT_TRUE(devsim_.Inject("qxev", "EventId 905001001 -t 1700000000" + params));
+    ASSERT_TRUE(devsim_.Inject("qxev", "EventId 905001001 -t 1700000100" + params));
     ASSERT_TRUE(WaitUntil([&] { return Stored(905001001) == "1700000100|2" + stored; }, std::chrono::seconds(20)))
             << Stored(905001001);
     EXPECT_TRUE(WaitUntil([this] {
@@ -93,9 +94,9 @@ TEST_F(EventSourceChainTest, RecordsAreStoredAndSurviveARestart) {
     })) << Log();
     StopDaemon();
 
-    StartDaemon("qxev=" + devsim.Path("qxev") + ",qx_exception_log=" + devsim.Path("qx_exception_log"));
-    ASSERT_TRUE(devsim.Inject("qx_exception_log", "kernel BUG at mm/slub.c:420\n"));
-    ASSERT_TRUE(devsim.Inject("qxev", "EventId 905001001 -t 1700000200" + params));
+    StartDaemon("qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + devsim_.Path("qx_exception_log"));
+    ASSERT_TRUE(devsim_.Inject("qx_exception_log", "kernel BUG at mm/slub.c:420\n"));
+    ASSERT_TRUE(devsim_.Inject("qxev", "EventId 905001001 -t 1700000200" + params));
     ASSERT_TRUE(WaitUntil([&] { return Stored(905001001) == "1700000200|3" + stored; }, std::chrono::seconds(20)))
             << Stored(905001001);
     StopDaemon();

@@ -1,6 +1,5 @@
-#include "service/host_binder_server.h"
+#include "host/service/host_binder_server.h"
 
-#include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -11,6 +10,8 @@
 #include <mutex>
 #include <tuple>
 #include <vector>
+
+#include <gtest/gtest.h>
 
 #include "service/IOrvaneNativeService.h"
 #include "tests/common/log_capture.h"

@@ -1,6 +1,5 @@
 #include "service/orvane_service.h"
 
-#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -11,8 +10,10 @@
 #include <thread>
 #include <vector>
 
+#include <gtest/gtest.h>
+
+#include "host/service/host_binder_server.h"
 #include "platform/plugin_factory.h"
-#include "service/host_binder_server.h"
 #include "service/orvane_native_service.h"
 #include "tests/common/log_capture.h"
 #include "utils/dev_info.h"

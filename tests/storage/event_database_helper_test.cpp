@@ -3,18 +3,18 @@
 #include <gtest/gtest.h>
 
 #include "storage/event_table.h"
-#include "tests/common/log_capture.h"
 #include "tests/common/fake_plugin_context.h"
+#include "tests/common/log_capture.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/time_util.h"
 
 namespace android::Orvane {
 
-constexpr uint32_t ID_QUOTA_2 = 901000002;   // its own daily count of 2
-constexpr uint32_t ID_QUOTA_48 = 901000001;  // its domain's 48
-constexpr uint32_t ID_OTHER = 902000001;     // the default of 200
-constexpr uint64_t DAY = 86400;
-const auto S = [](uint64_t value) { return std::to_string(value); };
+constexpr uint32_t kIdQuota2 = 901000002;   // its own daily count of 2
+constexpr uint32_t kIdQuota48 = 901000001;  // its domain's 48
+constexpr uint32_t kIdOther = 902000001;    // the default of 200
+constexpr uint64_t kDay = 86400;
+const auto kS = [](uint64_t value) { return std::to_string(value); };
 
 class EventDatabaseHelperTest : public ::testing::Test {
 protected:
@@ -38,7 +38,7 @@ protected:
         for (size_t at; (at = columns.find(',')) != std::string::npos;)
             columns.replace(at, 1, "||'/'||");
         return Column(path_, "select group_concat(v, ';') from (select " + columns + " as v from " + table +
-                                     " where event_id=" + S(id) + " order by id)")[0];
+                                     " where event_id=" + kS(id) + " order by id)")[0];
     }
 
     TempDir work_, config_;
@@ -53,87 +53,87 @@ TEST_F(EventDatabaseHelperTest, DailyQuotaNewDayAndOneReportPerDay) {
               "EventId 901000002 quota :\n    dailyCnt = 2\n    logCnt = 10    realLog = 0    logSpace = 300    "
               "sameLog = 0    inSub = 0\n    minEvent = 901000000    maxEvent = 901999999\n");
     uint64_t t0 = start_ + 1000;
-    EXPECT_EQ(Store(ID_QUOTA_48, t0), "");
+    EXPECT_EQ(Store(kIdQuota48, t0), "");
     LogCapture log;
     for (uint64_t t : {t0, t0 + 4000, t0 + 5000, t0 + 9000})  // an hour period apart: only the quota decides
-        EXPECT_EQ(Store(ID_QUOTA_2, t), t < t0 + 5000 ? "" : "over daily quota");
+        EXPECT_EQ(Store(kIdQuota2, t), t < t0 + 5000 ? "" : "over daily quota");
     EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO,
                              "DetectDropByTime event 901000002 over daily cnt drop it, dailyCnt=2 maxCnt=2"));
     // Drops are counted but leave the last happen time; the two kept events are one row of the day.
-    EXPECT_EQ(Rows(TBL_EVENT_DAILY, ID_QUOTA_2, "daily_cnt,over_cnt,last_happen_time"), "4/2/" + S(t0 + 4000));
-    EXPECT_EQ(Rows(TBL_EVENT_INFO, ID_QUOTA_2, "occured_cnt,first_time"), "2/" + S(t0 + 4000));
+    EXPECT_EQ(Rows(kTblEventDaily, kIdQuota2, "daily_cnt,over_cnt,last_happen_time"), "4/2/" + kS(t0 + 4000));
+    EXPECT_EQ(Rows(kTblEventInfo, kIdQuota2, "occured_cnt,first_time"), "2/" + kS(t0 + 4000));
 
     // A clock set back never starts a new day, nor does the last second of the day.
-    EXPECT_FALSE(helper_->ProcessNewDayEvent(MakeEvent(2, ID_QUOTA_2, start_ - 3 * DAY)));
-    EXPECT_FALSE(helper_->ProcessNewDayEvent(MakeEvent(2, ID_QUOTA_2, start_ + DAY - 1)));
-    uint64_t next = start_ + DAY + 500;
-    EXPECT_EQ(Store(ID_QUOTA_2, next), "");
+    EXPECT_FALSE(helper_->ProcessNewDayEvent(MakeEvent(2, kIdQuota2, start_ - 3 * kDay)));
+    EXPECT_FALSE(helper_->ProcessNewDayEvent(MakeEvent(2, kIdQuota2, start_ + kDay - 1)));
+    uint64_t next = start_ + kDay + 500;
+    EXPECT_EQ(Store(kIdQuota2, next), "");
     // The counters and their ids start over, event_info starts a new row, and the new day survives a restart.
     EXPECT_EQ(Column(path_, "select event_id||'/'||id||'/'||daily_cnt||'/'||over_cnt from event_daily"),
               Texts{"901000002/1/1/0"});
-    EXPECT_EQ(Rows(TBL_EVENT_INFO, ID_QUOTA_2, "occured_cnt"), "2;1");
+    EXPECT_EQ(Rows(kTblEventInfo, kIdQuota2, "occured_cnt"), "2;1");
     EventDatabase::getInstance()->Close();
     helper_ = new EventDatabaseHelper();
     ASSERT_TRUE(helper_->Init(&context_, "event.db", "OS3"));
     EXPECT_EQ(helper_->GetDbStartTime(), static_cast<uint64_t>(TimeUtil::GetZeroTimestampSec(next)));
-    EXPECT_EQ(Store(ID_QUOTA_2, next + 4000), "");
-    EXPECT_EQ(Store(ID_QUOTA_2, next + 4001), "over daily quota");
+    EXPECT_EQ(Store(kIdQuota2, next + 4000), "");
+    EXPECT_EQ(Store(kIdQuota2, next + 4001), "over daily quota");
 
     // The first drop of each day is reported; a marker queued after the drops shows that no other report is coming.
     context_.GetSharedWorkLoop()->AddTask([this] { context_.InsertEventToPipeline("marker", MakeEvent(0, 0, 0)); });
     ASSERT_TRUE(WaitUntil([&] { return context_.Inserted().size() >= 3; }));
     std::string inserted;
     for (const auto& [pipeline, e] : context_.Inserted())
-        inserted += pipeline + " " + S(e->eventType) + " " + S(e->eventId) + " " + S(e->happenTime) +
+        inserted += pipeline + " " + kS(e->eventType) + " " + kS(e->eventId) + " " + kS(e->happenTime) +
                     e->GetValue("param_list") + "\n";
     const std::string report = "dftFaultEvent 2 908001001 ";
     const std::string params = "{\"EventId\":901000002,\"DailyCnt\":2,\"MaxCnt\":2}\n";
-    EXPECT_EQ(inserted, report + S(t0 + 5000) + params + report + S(next + 4001) + params + "marker 0 0 0p\n");
+    EXPECT_EQ(inserted, report + kS(t0 + 5000) + params + report + kS(next + 4001) + params + "marker 0 0 0p\n");
 }
 
 TEST_F(EventDatabaseHelperTest, HourlyPacingAndOccurrencesPerParameterText) {
     uint64_t t0 = start_ + 2 * 3600;
-    Store(ID_QUOTA_48, t0);
+    Store(kIdQuota48, t0);
     // dailyCnt 1 leaves 47, so one event per period is free; the next must wait (day left)/47.
     LogCapture log;
-    EXPECT_EQ(Store(ID_QUOTA_48, t0 + 10), "event happen too sequence, drop it by punish");
+    EXPECT_EQ(Store(kIdQuota48, t0 + 10), "event happen too sequence, drop it by punish");
     EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO,
                              "DetectDropByTime event 901000001 over hour cnt drop it, hourCnt=2 halfCnt=1, maxCnt=48"));
-    EXPECT_EQ(Rows(TBL_EVENT_DAILY, ID_QUOTA_48, "daily_cnt,over_cnt,hour_cnt,last_happen_time"), "1/1/1/" + S(t0));
-    uint64_t spaced = t0 + (start_ + DAY - t0) / 47 + 1;
-    EXPECT_EQ(Store(ID_QUOTA_48, spaced), "");
-    EXPECT_EQ(Rows(TBL_EVENT_DAILY, ID_QUOTA_48, "daily_cnt,hour_cnt,last_happen_time"), "2/2/" + S(spaced));
+    EXPECT_EQ(Rows(kTblEventDaily, kIdQuota48, "daily_cnt,over_cnt,hour_cnt,last_happen_time"), "1/1/1/" + kS(t0));
+    uint64_t spaced = t0 + (start_ + kDay - t0) / 47 + 1;
+    EXPECT_EQ(Store(kIdQuota48, spaced), "");
+    EXPECT_EQ(Rows(kTblEventDaily, kIdQuota48, "daily_cnt,hour_cnt,last_happen_time"), "2/2/" + kS(spaced));
     // After a quiet spell the period moves by one hour per event, so both of these open one.
-    EXPECT_EQ(Store(ID_QUOTA_48, t0 + 5 * 3600), "");
-    EXPECT_EQ(Store(ID_QUOTA_48, t0 + 5 * 3600 + 1), "");
-    EXPECT_EQ(Rows(TBL_EVENT_DAILY, ID_QUOTA_48, "daily_cnt,hour_cnt,next_expire_time"), "4/1/" + S(t0 + 10800));
-    EXPECT_EQ(Rows(TBL_EVENT_INFO, ID_QUOTA_48, "occured_cnt"), "4");
+    EXPECT_EQ(Store(kIdQuota48, t0 + 5 * 3600), "");
+    EXPECT_EQ(Store(kIdQuota48, t0 + 5 * 3600 + 1), "");
+    EXPECT_EQ(Rows(kTblEventDaily, kIdQuota48, "daily_cnt,hour_cnt,next_expire_time"), "4/1/" + kS(t0 + 10800));
+    EXPECT_EQ(Rows(kTblEventInfo, kIdQuota48, "occured_cnt"), "4");
 
     // Occurrences of another id are counted per parameter text, one row each for the day.
     Texts params = {"'; drop table event_info; --", "100%", "\xff\xfe bad utf8"};
     uint64_t t = start_ + 100;
     std::string expected;
     for (const auto& text : params) {  // each past the hour period, so pacing keeps them all
-        EXPECT_EQ(Store(ID_OTHER, t += 4000, text), "");
-        EXPECT_EQ(Store(ID_OTHER, t += 4000, text), "");
-        expected += "2/1/0/0/" + S(t) + ";";  // first_time follows the latest occurrence
+        EXPECT_EQ(Store(kIdOther, t += 4000, text), "");
+        EXPECT_EQ(Store(kIdOther, t += 4000, text), "");
+        expected += "2/1/0/0/" + kS(t) + ";";  // first_time follows the latest occurrence
     }
-    EXPECT_EQ(Rows(TBL_EVENT_INFO, ID_OTHER, "occured_cnt,version_id,expire,visible,first_time") + ";", expected);
+    EXPECT_EQ(Rows(kTblEventInfo, kIdOther, "occured_cnt,version_id,expire,visible,first_time") + ";", expected);
     EXPECT_EQ(Column(path_, "select param_list from event_info where event_id = 902000001"), params);
 }
 
 TEST_F(EventDatabaseHelperTest, AbridgeRemovesOldestEventsAndShrinksTheFile) {
     uint64_t now = TimeUtil::GetTimestampSecond();
     sp<EventDatabase> db = EventDatabase::getInstance();
-    const Texts columns = {COL_EVENT_ID, COL_VERSION_ID, COL_FIRST_TIME, COL_PARAM_LIST};
-    for (uint64_t age : {90 * DAY, 61 * DAY, 40 * DAY, 20 * DAY, 2 * DAY}) {
+    const Texts columns = {kColEventId, kColVersionId, kColFirstTime, kColParamList};
+    for (uint64_t age : {90 * kDay, 61 * kDay, 40 * kDay, 20 * kDay, 2 * kDay}) {
         for (int i = 0; i < 10; i++) {
-            ASSERT_TRUE(db->Insert(TBL_EVENT_INFO, columns, {"1", "1", S(now - age), std::string(4000, 'f')}));
+            ASSERT_TRUE(db->Insert(kTblEventInfo, columns, {"1", "1", kS(now - age), std::string(4000, 'f')}));
             helper_->SaveRawEvent(MakeEvent(4, 100000, now - age, std::string(4000, 'f')));
         }
     }
-    ASSERT_TRUE(db->Insert(TBL_EVENT_INFO, columns, {"2", "1", S(now + DAY), "from the future"}));
-    Store(ID_QUOTA_48, now - 60);
+    ASSERT_TRUE(db->Insert(kTblEventInfo, columns, {"2", "1", kS(now + kDay), "from the future"}));
+    Store(kIdQuota48, now - 60);
     const std::string counts = "select (select count(*) from event_info)||','||(select count(*) from raw_events)";
     ASSERT_EQ(Column(path_, counts), Texts{"52,50"});
     LogCapture log;

@@ -1,12 +1,12 @@
 #include "storage/event_storage_manager.h"
 
-#include <gtest/gtest.h>
-
 #include <future>
 
+#include <gtest/gtest.h>
+
 #include "platform/plugin_factory.h"
-#include "tests/common/log_capture.h"
 #include "tests/common/fake_plugin_context.h"
+#include "tests/common/log_capture.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 

@@ -3,10 +3,11 @@
 
 #include "storage/sql_database.h"
 
-#include <gtest/gtest.h>
 #include <sqlite3.h>
 
 #include <atomic>
+
+#include <gtest/gtest.h>
 
 #include "storage/event_database.h"
 #include "storage/event_query.h"

@@ -1,13 +1,14 @@
 // The shipped plugin configuration, started by the real platform, with a test event source in
 // front of its fault pipeline: events are counted, dropped and stored in "event.db".
 
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+
+#include <gtest/gtest.h>
 
 #include "platform/plugin_factory.h"
 #include "platform/plugin_platform.h"

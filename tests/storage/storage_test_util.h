@@ -1,7 +1,6 @@
 #ifndef ORVANE_TESTS_STORAGE_STORAGE_TEST_UTIL_H
 #define ORVANE_TESTS_STORAGE_STORAGE_TEST_UTIL_H
 
-#include <gtest/gtest.h>
 #include <stdio.h>
 #include <stdlib.h>
 
@@ -10,6 +9,8 @@
 #include <functional>
 #include <iterator>
 #include <sstream>
+
+#include <gtest/gtest.h>
 
 #include "platform/event.h"
 #include "storage/sql_database.h"

@@ -1,12 +1,12 @@
 // The device emulator as a process: the character-device behaviour that the event sources
 // rely on, seen through ordinary system calls on its files.
-#include <gtest/gtest.h>
-
 #include <poll.h>
 #include <signal.h>
 
 #include <algorithm>
 #include <thread>
+
+#include <gtest/gtest.h>
 
 #include "tests/plugins/devsim_process.h"
 
@@ -17,12 +17,12 @@ class DevSimTest : public ::testing::Test {
 protected:
     void SetUp() override {
         std::string failure;
-        if (!devsim.Start(&failure)) {
+        if (!devsim_.Start(&failure)) {
             GTEST_SKIP() << "device emulator unavailable: " << failure;
         }
     }
 
-    int Open(const std::string& node, int flags) { return open(devsim.Path(node).c_str(), flags | O_CLOEXEC); }
+    int Open(const std::string& node, int flags) { return open(devsim_.Path(node).c_str(), flags | O_CLOEXEC); }
 
     static std::string ReadRecord(int fd, size_t size = 4096) {
         std::string buffer(size, '\0');
@@ -36,27 +36,28 @@ protected:
         return poll(&watch, 1, timeoutMs) == 1 ? watch.revents : 0;
     }
 
-    DevSim devsim;
+    DevSim devsim_;
 };
 
 TEST_F(DevSimTest, OneRecordPerReadAndAFullQueueLosesNothing) {
     int reader = Open("qxev", O_RDONLY);
     ASSERT_GE(reader, 0);
     EXPECT_EQ(0, Ready(reader, 0));
-    ASSERT_TRUE(devsim.Inject("qxev", "first record"));
-    ASSERT_TRUE(devsim.Inject("qxev", "second"));
+    ASSERT_TRUE(devsim_.Inject("qxev", "first record"));
+    ASSERT_TRUE(devsim_.Inject("qxev", "second"));
     EXPECT_EQ(POLLIN, Ready(reader, 5000));  // the kernel event device never reports priority data
     EXPECT_EQ("first record", ReadRecord(reader));
     EXPECT_EQ("second", ReadRecord(reader));
     // A short read takes the head of a record and leaves the rest for the next read.
-    ASSERT_TRUE(devsim.Inject("qxev", "0123456789"));
+    ASSERT_TRUE(devsim_.Inject("qxev", "0123456789"));
     EXPECT_EQ("0123", ReadRecord(reader, 4));
     EXPECT_EQ("456789", ReadRecord(reader));
     EXPECT_EQ(0, Ready(reader, 0));
     // Well past the queue's capacity: the writer is held, not refused.
     constexpr int kRecords = 3000;
     std::thread writer([&] {
-        for (int i = 0; i < kRecords; ++i) ASSERT_TRUE(devsim.Inject("qxev", "record " + std::to_string(i)));
+        for (int i = 0; i < kRecords; ++i)
+            ASSERT_TRUE(devsim_.Inject("qxev", "record " + std::to_string(i)));
     });
     for (int i = 0; i < kRecords; ++i) {
         ASSERT_EQ("record " + std::to_string(i), ReadRecord(reader));
@@ -70,7 +71,7 @@ TEST_F(DevSimTest, OneRecordPerReadAndAFullQueueLosesNothing) {
     alarm(1);
     EXPECT_EQ("", ReadRecord(reader));
     EXPECT_EQ(EINTR, errno);
-    ASSERT_TRUE(devsim.Inject("qxev", "after the interrupt"));
+    ASSERT_TRUE(devsim_.Inject("qxev", "after the interrupt"));
     EXPECT_EQ("after the interrupt", ReadRecord(reader));
     close(reader);
 }

@@ -1,8 +1,8 @@
 #include "utils/dev_info.h"
 
-#include <gtest/gtest.h>
-
 #include <cstdlib>
+
+#include <gtest/gtest.h>
 
 #include "utils/sys_env.h"
 

@@ -1,11 +1,12 @@
 #include "utils/file_util.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 
@@ -37,8 +38,10 @@ TEST_F(FileUtilTest, CreateDirectoryGivesTheModeOnlyToFoldersItCreates) {
     // Slashes doubled or at the end change nothing; an existing folder is left as it is.
     ASSERT_TRUE(CreateDirectory(x + "/y//z/", 0770));
     ASSERT_TRUE(CreateDirectory(x + "/y/q", 0700) && CreateDirectory(x + "/y", 0700));
-    struct { std::string path; mode_t mode; } cases[] = {
-        {x, 0751}, {x + "/y", 0770}, {x + "/y/z", 0770}, {x + "/y/q", 0700}};
+    struct {
+        std::string path;
+        mode_t mode;
+    } cases[] = {{x, 0751}, {x + "/y", 0770}, {x + "/y/z", 0770}, {x + "/y/q", 0700}};
     for (const auto& c : cases) {
         EXPECT_EQ(c.mode, Stat(c.path, true)) << c.path;
     }
@@ -46,8 +49,8 @@ TEST_F(FileUtilTest, CreateDirectoryGivesTheModeOnlyToFoldersItCreates) {
     LogCapture logs;
     EXPECT_FALSE(CreateDirectory(Path("file/sub/deeper"), 0775) || CreateDirectory("", 0775));
     EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "CreateDirectory mkdir " + Path("file/sub") + " failed, " +
-                                                     Path("file/sub/deeper") + ", err:Not a directory"))
-        << logs.Dump();
+                                                         Path("file/sub/deeper") + ", err:Not a directory"))
+            << logs.Dump();
 }
 
 TEST_F(FileUtilTest, LoadLimitNulTrimmingAndSaveModes) {

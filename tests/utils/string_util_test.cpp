@@ -21,13 +21,27 @@ TEST(StringUtilTest, TrimSplitPrefixAndEscapeBoundaries) {
 }
 
 TEST(StringUtilTest, NumberConversionEdges) {
-    struct { const char* in; int32_t i; uint32_t u; } cases[] = {
-        {"", 0, 0u}, {"abc", 0, 0u}, {"12abc", 12, 12u}, {"  -42", -42, 0u}, {"+7", 7, 7u}, {"0", 0, 0u},
-        {"2147483647", 2147483647, 2147483647u}, {"-2147483648", INT32_MIN, 0u},
-        // Beyond 32 bits: ConvertInt reports overflow, ConvertUInt cuts (not clamps) the 64-bit value.
-        {"2147483648", -1, 2147483648u}, {"-2147483649", -1, 0u}, {"4294967295", -1, 4294967295u},
-        {"4294967297", -1, 1u}, {"9223372036854775807", -1, 4294967295u},
-        {"9223372036854775808", -1, 0u}, {"-99999999999999999999", -1, 0u},
+    struct {
+        const char* in;
+        int32_t i;
+        uint32_t u;
+    } cases[] = {
+            {"", 0, 0u},
+            {"abc", 0, 0u},
+            {"12abc", 12, 12u},
+            {"  -42", -42, 0u},
+            {"+7", 7, 7u},
+            {"0", 0, 0u},
+            {"2147483647", 2147483647, 2147483647u},
+            {"-2147483648", INT32_MIN, 0u},
+            // Beyond 32 bits: ConvertInt reports overflow, ConvertUInt cuts (not clamps) the 64-bit value.
+            {"2147483648", -1, 2147483648u},
+            {"-2147483649", -1, 0u},
+            {"4294967295", -1, 4294967295u},
+            {"4294967297", -1, 1u},
+            {"9223372036854775807", -1, 4294967295u},
+            {"9223372036854775808", -1, 0u},
+            {"-99999999999999999999", -1, 0u},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.in);

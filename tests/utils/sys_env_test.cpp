@@ -1,12 +1,13 @@
 #include "utils/sys_env.h"
 
-#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <vector>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
@@ -24,31 +25,45 @@ std::string ChooseFile() {
     }
     return getenv("ORVANE_PROPERTY_FILE");
 }
-const std::string gPath = ChooseFile();
+const std::string kGPath = ChooseFile();
 
-std::string Get(const std::string& key) { return SysEnv::GetSysProperity(key, "unset"); }
+std::string Get(const std::string& key) {
+    return SysEnv::GetSysProperity(key, "unset");
+}
 
 class SysEnvTest : public testing::Test {
 protected:
-    void SetUp() override { unlink(gPath.c_str()); }
+    void SetUp() override { unlink(kGPath.c_str()); }
 };
 
 TEST_F(SysEnvTest, ReadsBuildPropFormatAndRewritesOnlyTheKey) {
-    ASSERT_TRUE(FileUtil::SaveStringToFile(gPath, "# comment line\nro.a=1\nthis line is malformed\n=novalue\n"
-        "  spaced.key = spaced value\nwith.equals=a=b\ndup=old\ndup=new\nempty=\n", true));
+    ASSERT_TRUE(FileUtil::SaveStringToFile(kGPath,
+                                           "# comment line\nro.a=1\nthis line is malformed\n=novalue\n"
+                                           "  spaced.key = spaced value\nwith.equals=a=b\ndup=old\ndup=new\nempty=\n",
+                                           true));
     LogCapture logs;
-    struct { const char* key; const char* value; } cases[] = {{"ro.a", "1"}, {"spaced.key", " spaced value"},
-        {"with.equals", "a=b"}, {"dup", "new"}, {"empty", "unset"} /* empty reads as unset */, {"ro.missing", "unset"}};
+    struct {
+        const char* key;
+        const char* value;
+    } cases[] = {{"ro.a", "1"},
+                 {"spaced.key", " spaced value"},
+                 {"with.equals", "a=b"},
+                 {"dup", "new"},
+                 {"empty", "unset"} /* empty reads as unset */,
+                 {"ro.missing", "unset"}};
     for (const auto& c : cases) {
         EXPECT_EQ(c.value, Get(c.key)) << c.key;
     }
-    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "GetSysProperity skipped 2 malformed lines in " + gPath)) << logs.Dump();
+    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "GetSysProperity skipped 2 malformed lines in " + kGPath))
+            << logs.Dump();
     // A write keeps comments and foreign lines, replaces the key in place and drops its duplicates.
     ASSERT_TRUE(SysEnv::SetSysProperity("dup", "newest") && SysEnv::SetSysProperity("ro.b", "2"));
     std::string text;
-    ASSERT_TRUE(FileUtil::LoadStringFromFile(gPath, text));
-    EXPECT_EQ("# comment line\nro.a=1\nthis line is malformed\n=novalue\n  spaced.key = spaced value\n"
-              "with.equals=a=b\ndup=newest\nempty=\nro.b=2\n", text);
+    ASSERT_TRUE(FileUtil::LoadStringFromFile(kGPath, text));
+    EXPECT_EQ(
+            "# comment line\nro.a=1\nthis line is malformed\n=novalue\n  spaced.key = spaced value\n"
+            "with.equals=a=b\ndup=newest\nempty=\nro.b=2\n",
+            text);
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, "malformed")) << logs.Dump();  // no second warning
 }
 
@@ -58,7 +73,7 @@ TEST_F(SysEnvTest, BadValuesKeysAndUnreadableFilesAreRefused) {
     ASSERT_TRUE(SysEnv::SetSysProperity("persist.sys.long", longest));
     EXPECT_FALSE(SysEnv::SetSysProperity("persist.sys.long", std::string(92, 'w')));
     EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity value of persist.sys.long is 92 bytes, at most 91"))
-        << logs.Dump();
+            << logs.Dump();
     EXPECT_EQ(longest, Get("persist.sys.long"));
     EXPECT_FALSE(SysEnv::SetSysProperity("bad key", "1") || SysEnv::SetSysProperity("", "1") ||
                  SysEnv::SetSysProperity("k", "two\nlines"));
@@ -66,16 +81,18 @@ TEST_F(SysEnvTest, BadValuesKeysAndUnreadableFilesAreRefused) {
     EXPECT_EQ("unset", Get("k"));
 
     // A folder where the file should be: it opens, but cannot be read; the caller goes on.
-    ASSERT_TRUE(unlink(gPath.c_str()) == 0 && mkdir(gPath.c_str(), 0755) == 0);
+    ASSERT_TRUE(unlink(kGPath.c_str()) == 0 && mkdir(kGPath.c_str(), 0755) == 0);
     EXPECT_EQ("unset", Get("persist.sys.long"));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_WARN, "GetSysProperity cannot read " + gPath)) << logs.Dump();
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_WARN, "GetSysProperity cannot read " + kGPath)) << logs.Dump();
     EXPECT_FALSE(SysEnv::SetSysProperity("ro.any", "1"));
-    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity cannot read " + gPath)) << logs.Dump();
-    ASSERT_EQ(0, rmdir(gPath.c_str()));
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_ERROR, "SetSysProperity cannot read " + kGPath)) << logs.Dump();
+    ASSERT_EQ(0, rmdir(kGPath.c_str()));
 }
 
 constexpr int kKeys = 40;
-std::string Key(int writer, int k) { return "w" + std::to_string(writer) + ".k" + std::to_string(k); }
+std::string Key(int writer, int k) {
+    return "w" + std::to_string(writer) + ".k" + std::to_string(k);
+}
 bool WriteKeys(int writer) {
     bool ok = true;
     for (int k = 0; k < kKeys; ++k) {
@@ -119,7 +136,7 @@ TEST_F(SysEnvTest, ProcessesShareTheFileAndLoseNoKey) {
         }
     }
     // An edit in place (same file, new size) is seen as well.
-    ASSERT_EQ(0, system(("printf 'shell.key=yes\\n' >> '" + gPath + "'").c_str()));
+    ASSERT_EQ(0, system(("printf 'shell.key=yes\\n' >> '" + kGPath + "'").c_str()));
     EXPECT_EQ("yes", Get("shell.key"));
 }
 

@@ -1,9 +1,10 @@
 #include "utils/time_util.h"
 
-#include <gtest/gtest.h>
 #include <time.h>
 
 #include <cstdlib>
+
+#include <gtest/gtest.h>
 
 namespace android::Orvane {
 
@@ -17,8 +18,11 @@ constexpr int64_t kSample = 1709622489;  // 2024-03-05 07:08:09 UTC
 
 TEST(TimeUtilTest, MidnightsInSeveralZonesAndClockUnits) {
     // POSIX TZ strings name the offset west; `east` is seconds east of UTC.
-    struct { const char* tz; int64_t east; } zones[] = {
-        {"UTC0", 0}, {"CST-8", 8 * 3600}, {"EST5", -5 * 3600}, {"<+1345>-13:45", 49500}, {"<-11>11", -11 * 3600}};
+    struct {
+        const char* tz;
+        int64_t east;
+    } zones[] = {
+            {"UTC0", 0}, {"CST-8", 8 * 3600}, {"EST5", -5 * 3600}, {"<+1345>-13:45", 49500}, {"<-11>11", -11 * 3600}};
     for (const auto& z : zones) {
         SetZone(z.tz);
         for (int64_t t : {kSample, int64_t{86400} * 20000 + 1, int64_t{86400} * 20000 - 1}) {

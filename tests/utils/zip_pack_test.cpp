@@ -1,11 +1,11 @@
 #include "utils/zip_pack.h"
 
-#include <gtest/gtest.h>
-
 #include <cstdlib>
 #include <fstream>
 #include <iterator>
 #include <memory>
+
+#include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
 #include "utils/file_util.h"
@@ -71,19 +71,28 @@ TEST_F(ZipPackTest, WritesWholeBatchesAndTheRestOnlyOnClose) {
     std::vector<std::string> files = MakeFiles(120);
     auto first = [&](int n) { return std::vector<std::string>(files.begin(), files.begin() + n); };
     // Destroyed without Close, a pack keeps only its full batches of 50; the rest is discarded.
-    struct { std::vector<std::vector<std::string>> calls; bool close; size_t entries; } cases[] = {
-        {{first(49)}, false, 0}, {{first(50)}, false, 50}, {{files}, false, 100},
-        {{first(49), {files[49]}}, false, 50}, {{files}, true, 120}};
+    struct {
+        std::vector<std::vector<std::string>> calls;
+        bool close;
+        size_t entries;
+    } cases[] = {{{first(49)}, false, 0},
+                 {{first(50)}, false, 50},
+                 {{files}, false, 100},
+                 {{first(49), {files[49]}}, false, 50},
+                 {{files}, true, 120}};
     for (const auto& c : cases) {
         auto pack = std::make_unique<ZipPack>();
         ASSERT_TRUE(pack->CreateZip(zip_));
-        for (const auto& paths : c.calls) EXPECT_TRUE(pack->AddFiles(paths));
-        if (c.close) pack->Close();
+        for (const auto& paths : c.calls)
+            EXPECT_TRUE(pack->AddFiles(paths));
+        if (c.close)
+            pack->Close();
         pack.reset();
         EXPECT_EQ(ListEntries(zip_).size(), c.entries) << c.calls.size() << " calls, first " << c.calls[0].size();
     }
     std::vector<std::string> entries = ListEntries(zip_);
-    for (size_t i = 0; i < entries.size(); ++i) EXPECT_EQ(entries[i], files[i].substr(1)) << "in order, no leading slash";
+    for (size_t i = 0; i < entries.size(); ++i)
+        EXPECT_EQ(entries[i], files[i].substr(1)) << "in order, no leading slash";
     EXPECT_EQ(0, system(("unzip -tqq " + zip_ + " >/dev/null").c_str()));
 }
 
@@ -111,7 +120,7 @@ TEST_F(ZipPackTest, FailedFilesDirectoriesAndReadBack) {
     auto entries = ListEntries(zip_);
     ASSERT_EQ(entries.size(), 56u);
     EXPECT_EQ(entries[0], missing.substr(1));  // failed files still leave an (empty) entry
-    EXPECT_EQ(entries[50], "extra/");  // written at once, the other files only on Close
+    EXPECT_EQ(entries[50], "extra/");          // written at once, the other files only on Close
     EXPECT_EQ(entries[51], longDir.substr(1) + "/");
 
     ASSERT_TRUE(reader_.Open(zip_));

@@ -7,8 +7,8 @@
 
 #include <utils/String8.h>
 
+#include "host/service/host_binder_server.h"
 #include "service/IOrvaneNativeService.h"
-#include "service/host_binder_server.h"
 
 using namespace android;
 using namespace android::Orvane;

@@ -11,8 +11,8 @@ AOSP=/usr/lib/$(gcc -print-multiarch)/android
 mkdir -p "$OUT/corpus"
 clang++ -std=c++17 -g -O1 -fsanitize=fuzzer,address,undefined -fno-sanitize-recover=undefined \
     -I"$ROOT" -isystem /usr/include/android \
-    "$ROOT/tools/fuzz/request_decoder_fuzzer.cpp" "$ROOT/service/host_binder.cpp" \
-    "$ROOT/service/host_binder_server.cpp" "$ROOT/service/IOrvaneNativeService.cpp" \
+    "$ROOT/tools/fuzz/request_decoder_fuzzer.cpp" "$ROOT/host/service/host_binder.cpp" \
+    "$ROOT/host/service/host_binder_server.cpp" "$ROOT/service/IOrvaneNativeService.cpp" \
     "$AOSP/libutils.so" "$AOSP/liblog.so" "$AOSP/libcutils.so" -Wl,-rpath,"$AOSP" -lpthread \
     -o "$OUT/request_decoder_fuzzer"
 

@@ -1,8 +1,6 @@
 // orvane-devsim: emulates the kernel's event device nodes ("qxev", "qx_exception_log") on a
 // host through FUSE, with character-device semantics, so that the event sources run unchanged
 // against files in a folder. See Usage() for the command line.
-#include "record_node.h"
-
 #include <errno.h>
 #include <fcntl.h>
 #include <linux/fuse.h>
@@ -17,6 +15,8 @@
 #include <mutex>
 #include <string>
 #include <unordered_set>
+
+#include "record_node.h"
 
 namespace {
 
@@ -99,7 +99,9 @@ void DoReaddir(fuse_req_t req, fuse_ino_t ino, size_t size, off_t offset, fuse_f
         const char* name;
         fuse_ino_t ino;
     };
-    const Entry entries[] = {{".", FUSE_ROOT_ID}, {"..", FUSE_ROOT_ID}, {gQxev.name, gQxev.ino},
+    const Entry entries[] = {{".", FUSE_ROOT_ID},
+                             {"..", FUSE_ROOT_ID},
+                             {gQxev.name, gQxev.ino},
                              {gExceptionLog.name, gExceptionLog.ino}};
     constexpr off_t kEntryCount = sizeof(entries) / sizeof(entries[0]);
     std::string buffer;
@@ -222,10 +224,9 @@ int Serve(const char* program, const std::string& folder) {
     io.read = WireRead;
     io.writev = WireWritev;
     bool failed = false;
-    if (fuse_session_custom_io(session, &io, fuse_session_fd(session)) == 0 &&
-        fuse_set_signal_handlers(session) == 0) {
-        fprintf(stderr, "orvane-devsim: serving %s/%s and %s/%s\n", folder.c_str(), gQxev.name,
-                folder.c_str(), gExceptionLog.name);
+    if (fuse_session_custom_io(session, &io, fuse_session_fd(session)) == 0 && fuse_set_signal_handlers(session) == 0) {
+        fprintf(stderr, "orvane-devsim: serving %s/%s and %s/%s\n", folder.c_str(), gQxev.name, folder.c_str(),
+                gExceptionLog.name);
         fuse_loop_config* config = fuse_loop_cfg_create();
         fuse_loop_cfg_set_clone_fd(config, 0);
         // Negative on failure; the signal's number when one ended the loop, which is the way out.

@@ -76,8 +76,8 @@ void RecordNode::OnInterrupt(fuse_req_t req, void* node) {
 
 void RecordNode::Interrupt(fuse_req_t req) {
     std::lock_guard<std::mutex> guard(lock);
-    auto read = std::find_if(heldReads.begin(), heldReads.end(),
-                             [req](const HeldRead& held) { return held.req == req; });
+    auto read =
+            std::find_if(heldReads.begin(), heldReads.end(), [req](const HeldRead& held) { return held.req == req; });
     if (read != heldReads.end()) {
         heldReads.erase(read);
         fuse_reply_err(req, EINTR);

@@ -31,17 +31,17 @@ double Seconds(Clock::duration span) {
 class CommitWatch {
 public:
     bool Open(const std::string& workDir) {
-        fd = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
-        return fd >= 0 && inotify_add_watch(fd, workDir.c_str(), IN_DELETE) >= 0;
+        fd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
+        return fd_ >= 0 && inotify_add_watch(fd_, workDir.c_str(), IN_DELETE) >= 0;
     }
     ~CommitWatch() {
-        if (fd >= 0) {
-            close(fd);
+        if (fd_ >= 0) {
+            close(fd_);
         }
     }
     // Waits up to `timeoutMs` for commits; returns how many arrived (0 on time-out).
     int Wait(int timeoutMs) {
-        struct pollfd watch = {fd, POLLIN, 0};
+        struct pollfd watch = {fd_, POLLIN, 0};
         if (poll(&watch, 1, timeoutMs) <= 0) {
             return 0;
         }
@@ -52,7 +52,7 @@ public:
         alignas(inotify_event) char buffer[4096];
         int commits = 0;
         ssize_t length;
-        while ((length = read(fd, buffer, sizeof(buffer))) > 0) {
+        while ((length = read(fd_, buffer, sizeof(buffer))) > 0) {
             for (char* at = buffer; at < buffer + length;) {
                 auto* event = reinterpret_cast<inotify_event*>(at);
                 if (event->len > 0 && strcmp(event->name, "event.db-journal") == 0) {
@@ -69,7 +69,7 @@ public:
     Clock::time_point lastCommit;
 
 private:
-    int fd = -1;
+    int fd_ = -1;
 };
 
 struct ProcessUsage {

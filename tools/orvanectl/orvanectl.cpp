@@ -9,8 +9,8 @@
 #include <string>
 #include <vector>
 
+#include "host/service/host_binder_server.h"
 #include "service/IOrvaneNativeService.h"
-#include "service/host_binder_server.h"
 #include "utils/sys_env.h"
 
 using namespace android;
@@ -19,22 +19,22 @@ using namespace android::Orvane;
 namespace {
 
 const char* const kUsage =
-    "usage: orvanectl [--workdir DIR] COMMAND [ARGS...]\n"
-    "\n"
-    "Commands to the daemon (its socket is DIR/orvane.sock, DIR defaults to /data/quorlog/orvane/):\n"
-    "  pack-log               ask for a log pack; prints the daemon's result\n"
-    "  run-mode NAME FILE     set the run mode\n"
-    "  upload-switch on|off   switch uploads on or off\n"
-    "  config-update FOLDER   announce new cloud configuration in FOLDER\n"
-    "  user-activated         announce that the user has activated the device\n"
-    "  dump [ARGS...]         print the daemon's dump (\"plugin NAME [ARGS...]\" for one plugin)\n"
-    "Host system properties (the file named by ORVANE_PROPERTY_FILE):\n"
-    "  getprop KEY            print the value\n"
-    "  setprop KEY VALUE      set the value\n"
-    "Options:\n"
-    "  --workdir DIR          the daemon's work folder\n"
-    "  --help                 this text\n"
-    "Exit status: 0 when the daemon answered OK, 1 otherwise, 2 for a bad command line.\n";
+        "usage: orvanectl [--workdir DIR] COMMAND [ARGS...]\n"
+        "\n"
+        "Commands to the daemon (its socket is DIR/orvane.sock, DIR defaults to /data/quorlog/orvane/):\n"
+        "  pack-log               ask for a log pack; prints the daemon's result\n"
+        "  run-mode NAME FILE     set the run mode\n"
+        "  upload-switch on|off   switch uploads on or off\n"
+        "  config-update FOLDER   announce new cloud configuration in FOLDER\n"
+        "  user-activated         announce that the user has activated the device\n"
+        "  dump [ARGS...]         print the daemon's dump (\"plugin NAME [ARGS...]\" for one plugin)\n"
+        "Host system properties (the file named by ORVANE_PROPERTY_FILE):\n"
+        "  getprop KEY            print the value\n"
+        "  setprop KEY VALUE      set the value\n"
+        "Options:\n"
+        "  --workdir DIR          the daemon's work folder\n"
+        "  --help                 this text\n"
+        "Exit status: 0 when the daemon answered OK, 1 otherwise, 2 for a bad command line.\n";
 
 int Fail(const std::string& message) {
     fprintf(stderr, "orvanectl: %s\n", message.c_str());

@@ -1,5 +1,5 @@
-#ifndef ORVANE_SERVICE_HOST_BINDER_SERVER_H
-#define ORVANE_SERVICE_HOST_BINDER_SERVER_H
+#ifndef ORVANE_HOST_SERVICE_HOST_BINDER_SERVER_H
+#define ORVANE_HOST_SERVICE_HOST_BINDER_SERVER_H
 
 // The host's binder transport: binder objects served over Unix stream sockets.
 //
@@ -24,7 +24,7 @@
 
 #include <utils/RefBase.h>
 
-#include "service/host_binder.h"
+#include "host/service/host_binder.h"
 
 namespace android {
 namespace Orvane {
@@ -133,4 +133,4 @@ private:
 }  // namespace android
 
 #endif  // !__ANDROID__
-#endif  // ORVANE_SERVICE_HOST_BINDER_SERVER_H
+#endif  // ORVANE_HOST_SERVICE_HOST_BINDER_SERVER_H

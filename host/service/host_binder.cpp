@@ -1,4 +1,4 @@
-#include "service/host_binder.h"
+#include "host/service/host_binder.h"
 
 #if !defined(__ANDROID__)
 
@@ -15,7 +15,9 @@ static_assert(__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__, "the parcel copies litt
 constexpr int32_t kUnsetWorkSource = -1;
 constexpr int32_t kSystemHeader = ('S' << 24) | ('Y' << 16) | ('S' << 8) | 'T';
 
-size_t PadSize(size_t size) { return (size + 3) & ~static_cast<size_t>(3); }
+size_t PadSize(size_t size) {
+    return (size + 3) & ~static_cast<size_t>(3);
+}
 
 }  // namespace
 
@@ -27,7 +29,9 @@ Parcel::~Parcel() {
     }
 }
 
-void Parcel::setDataPosition(size_t position) const { position_ = position > data_.size() ? data_.size() : position; }
+void Parcel::setDataPosition(size_t position) const {
+    position_ = position > data_.size() ? data_.size() : position;
+}
 
 status_t Parcel::setDataSize(size_t size) {
     data_.resize(size);
@@ -65,7 +69,9 @@ status_t Parcel::Append(const void* bytes, size_t length) {
     return OK;
 }
 
-status_t Parcel::writeInt32(int32_t value) { return Append(&value, sizeof(value)); }
+status_t Parcel::writeInt32(int32_t value) {
+    return Append(&value, sizeof(value));
+}
 
 status_t Parcel::writeString16(const String16& str) {
     size_t units = str.size();
@@ -216,11 +222,13 @@ status_t Status::readFromParcel(const Parcel& parcel) {
 }  // namespace binder
 
 const String16& BBinder::getInterfaceDescriptor() const {
-    static const String16 empty;
-    return empty;
+    static const String16 kEmpty;
+    return kEmpty;
 }
 
-status_t BBinder::dump(int, const Vector<String16>&) { return OK; }
+status_t BBinder::dump(int, const Vector<String16>&) {
+    return OK;
+}
 
 status_t BBinder::transact(uint32_t code, const Parcel& data, Parcel* reply, uint32_t flags) {
     data.setDataPosition(0);

@@ -2,7 +2,7 @@
 
 #if !defined(__ANDROID__)
 
-#include "service/host_binder_server.h"
+#include "host/service/host_binder_server.h"
 
 namespace android {
 namespace Orvane {
@@ -17,13 +17,17 @@ HostBinderServer& Server() {
 
 }  // namespace
 
-void StartThreadPool(size_t maxThreads) { Server().StartThreadPool(maxThreads); }
+void StartThreadPool(size_t maxThreads) {
+    Server().StartThreadPool(maxThreads);
+}
 
 bool AddService(const std::string& name, const sp<BBinder>& service, const std::string& workDir) {
     return Server().AddService(workDir + name + ".sock", service);
 }
 
-void JoinThreadPool() { Server().JoinThreadPool(); }
+void JoinThreadPool() {
+    Server().JoinThreadPool();
+}
 
 }  // namespace BinderTransport
 }  // namespace Orvane

@@ -1,5 +1,5 @@
-#ifndef ORVANE_SERVICE_HOST_BINDER_H
-#define ORVANE_SERVICE_HOST_BINDER_H
+#ifndef ORVANE_HOST_SERVICE_HOST_BINDER_H
+#define ORVANE_HOST_SERVICE_HOST_BINDER_H
 
 // The few libbinder classes the service uses, for hosts without libbinder. They keep
 // libbinder's names and behaviour so that the service's code is the same on both platforms;
@@ -148,4 +148,4 @@ private:
 }  // namespace android
 
 #endif  // !__ANDROID__
-#endif  // ORVANE_SERVICE_HOST_BINDER_H
+#endif  // ORVANE_HOST_SERVICE_HOST_BINDER_H

@@ -1,4 +1,4 @@
-#include "service/host_binder_server.h"
+#include "host/service/host_binder_server.h"
 
 #if !defined(__ANDROID__)
 
@@ -337,8 +337,7 @@ bool HostBinderServer::ReadAndServe(Connection& conn) {
         if (!Serve(conn, header, conn.buffer.data() + HostBinderFrame::kRequestHeaderSize)) {
             return false;
         }
-        conn.buffer.erase(conn.buffer.begin(),
-                          conn.buffer.begin() + HostBinderFrame::kRequestHeaderSize + header.size);
+        conn.buffer.erase(conn.buffer.begin(), conn.buffer.begin() + HostBinderFrame::kRequestHeaderSize + header.size);
     }
 }
 
@@ -389,7 +388,8 @@ void HostBinderServer::CloseIdleConnections() {
 bool HostBinderServer::EvictIdlestConnection() {
     auto idlest = connections_.end();
     for (auto it = connections_.begin(); it != connections_.end(); ++it) {
-        if (!it->second->busy && (idlest == connections_.end() || it->second->lastActive < idlest->second->lastActive)) {
+        if (!it->second->busy &&
+            (idlest == connections_.end() || it->second->lastActive < idlest->second->lastActive)) {
             idlest = it;
         }
     }

@@ -1,0 +1,285 @@
+// The host's property store: a text file of key=value lines named by ORVANE_PROPERTY_FILE, shared
+// with other processes, or the process's own memory without that variable. Host builds only;
+// a device uses the property service (utils/sys_env.cpp).
+#include "utils/sys_env.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <mutex>
+
+#include "utils/orvane_log.h"
+#include "utils/string_util.h"
+
+namespace android {
+namespace Orvane {
+
+namespace {
+
+// One line of a property file: a key=value entry, a blank or comment line, or neither.
+enum class LineKind { kEntry, kBlank, kMalformed };
+
+LineKind ParseLine(std::string line, std::string& key, std::string& value) {
+    if (!line.empty() && line.back() == '\r') {
+        line.pop_back();
+    }
+    size_t start = line.find_first_not_of(" \t");
+    if (start == std::string::npos || line[start] == '#') {
+        return LineKind::kBlank;
+    }
+    size_t eq = line.find('=', start);
+    if (eq == std::string::npos) {
+        return LineKind::kMalformed;
+    }
+    key = line.substr(start, eq - start);
+    key.erase(key.find_last_not_of(" \t") + 1);  // npos + 1 == 0 empties an all-blank key
+    value = line.substr(eq + 1);
+    return SysEnv::IsValidKey(key) ? LineKind::kEntry : LineKind::kMalformed;
+}
+
+// Whole content of an open file; false on a read error.
+bool ReadAll(int fd, std::string& text) {
+    char buffer[4096];
+    ssize_t got;
+    while ((got = read(fd, buffer, sizeof(buffer))) != 0) {
+        if (got < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return false;
+        }
+        text.append(buffer, static_cast<size_t>(got));
+    }
+    return true;
+}
+
+bool WriteAll(int fd, const std::string& text) {
+    size_t done = 0;
+    while (done < text.size()) {
+        ssize_t put = write(fd, text.data() + done, text.size() - done);
+        if (put < 0 && errno != EINTR) {
+            return false;
+        }
+        done += put > 0 ? static_cast<size_t>(put) : 0;
+    }
+    return true;
+}
+
+// The host's property service. With ORVANE_PROPERTY_FILE set, the properties live in that
+// file (build.prop format) and are shared with other processes: a read reparses the file when
+// its identity (inode, size, modification time) changed; a write rewrites it, keeping comments
+// and foreign lines, through a temporary file renamed over it while holding an flock on a
+// side lock file, so concurrent writers never lose each other's keys. Without the variable the
+// properties live in this process only.
+// Threads: any thread may call; `mutex_` guards every member.
+class HostPropertyStore {
+public:
+    static HostPropertyStore& Get() {
+        static HostPropertyStore store;
+        return store;
+    }
+
+    std::string Read(const std::string& key, const std::string& defaultValue) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        if (!path_.empty()) {
+            RefreshLocked();
+        }
+        auto it = values_.find(key);
+        // An empty value reads as unset, as on the device.
+        return it == values_.end() || it->second.empty() ? defaultValue : it->second;
+    }
+
+    bool Write(const std::string& key, const std::string& value) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        if (path_.empty()) {
+            values_[key] = value;
+            return true;
+        }
+        // The lock file is never replaced, unlike the property file, so all writers lock one inode.
+        const std::string lockPath = path_ + ".lock";
+        int lockFd = open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0660);
+        if (lockFd < 0) {
+            OLOG_AS(ANDROID_LOG_ERROR, "SetSysProperity", "%s open %s failed, err:%s", lockPath.c_str(),
+                    strerror(errno));
+            return false;
+        }
+        while (flock(lockFd, LOCK_EX) != 0 && errno == EINTR) {
+        }
+        bool ok = WriteLocked(key, value);
+        close(lockFd);  // releases the lock
+        return ok;
+    }
+
+private:
+    struct Stamp {
+        dev_t device = 0;
+        ino_t inode = 0;
+        off_t size = -1;
+        int64_t mtimeNs = -1;
+        bool operator==(const Stamp& o) const {
+            return device == o.device && inode == o.inode && size == o.size && mtimeNs == o.mtimeNs;
+        }
+    };
+
+    HostPropertyStore() {
+        const char* path = getenv("ORVANE_PROPERTY_FILE");
+        if (path != nullptr) {
+            path_ = path;
+        }
+    }
+
+    static Stamp StampOf(const struct stat& st) {
+        return {st.st_dev, st.st_ino, st.st_size,
+                static_cast<int64_t>(st.st_mtim.tv_sec) * 1000000000 + st.st_mtim.tv_nsec};
+    }
+
+    // Reads the file when it changed since the last parse. A missing file holds no properties;
+    // an unreadable one is reported once and read as empty; neither stops the caller.
+    void RefreshLocked() {
+        struct stat st;
+        if (stat(path_.c_str(), &st) == 0 && StampOf(st) == stamp_) {
+            return;
+        }
+        std::string text;
+        Stamp stamp;
+        int err = ReadFile(text, stamp, nullptr);
+        if (err != 0 && err != ENOENT) {
+            if (err != lastReadErrno_) {
+                OLOG_AS(ANDROID_LOG_WARN, "GetSysProperity", "%s cannot read %s, err:%s", path_.c_str(), strerror(err));
+            }
+            lastReadErrno_ = err;
+            stamp = {};
+        } else {
+            lastReadErrno_ = 0;
+        }
+        if (stamp == stamp_) {
+            return;
+        }
+        stamp_ = stamp;
+        Parse(text);
+    }
+
+    // Opens and reads the property file; 0 or the error number. `stamp` (and `mode` when
+    // asked) describe the version read; a missing file gives an empty text.
+    int ReadFile(std::string& text, Stamp& stamp, mode_t* mode) {
+        int fd = open(path_.c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd < 0) {
+            return errno;
+        }
+        struct stat st;
+        int err = 0;
+        if (fstat(fd, &st) != 0 || !ReadAll(fd, text)) {
+            err = errno;
+        } else {
+            stamp = StampOf(st);
+            if (mode != nullptr) {
+                *mode = st.st_mode & 07777;
+            }
+        }
+        close(fd);
+        return err;
+    }
+
+    // Replaces `values_` with the entries of `text`; a later line for a key wins. Malformed
+    // lines are skipped with one warning for the lot, and only when they differ from the lines
+    // already warned about, so a bad line does not warn again at every reload.
+    void Parse(const std::string& text) {
+        values_.clear();
+        std::string malformed;
+        size_t count = 0;
+        for (const std::string& line : StringUtil::SplitStr(text, '\n')) {
+            std::string key;
+            std::string value;
+            switch (ParseLine(line, key, value)) {
+                case LineKind::kEntry:
+                    values_[key] = value;
+                    break;
+                case LineKind::kMalformed:
+                    malformed += line + '\n';
+                    ++count;
+                    break;
+                case LineKind::kBlank:
+                    break;
+            }
+        }
+        if (count > 0 && malformed != warnedMalformed_) {
+            OLOG_AS(ANDROID_LOG_WARN, "GetSysProperity", "%s skipped %zu malformed lines in %s", count, path_.c_str());
+        }
+        warnedMalformed_ = malformed;
+    }
+
+    // Called with the file lock held: rereads the file so that no other writer's change is lost,
+    // sets the key on its own line (in place, or appended), and renames the new text over it.
+    bool WriteLocked(const std::string& key, const std::string& value) {
+        std::string text;
+        Stamp stamp;
+        mode_t mode = 0644;
+        int err = ReadFile(text, stamp, &mode);
+        if (err != 0 && err != ENOENT) {
+            // Rewriting a file that could not be read would drop every other property in it.
+            OLOG_AS(ANDROID_LOG_ERROR, "SetSysProperity", "%s cannot read %s, err:%s", path_.c_str(), strerror(err));
+            return false;
+        }
+        std::string updated;
+        bool placed = false;
+        for (std::string line : StringUtil::SplitStr(text, '\n')) {
+            std::string lineKey;
+            std::string lineValue;
+            if (ParseLine(line, lineKey, lineValue) == LineKind::kEntry && lineKey == key) {
+                if (placed) {
+                    continue;  // duplicates of the key go; its first line holds the value now
+                }
+                line = key + "=" + value;
+                placed = true;
+            }
+            updated += line + '\n';
+        }
+        if (!placed) {
+            updated += key + "=" + value + '\n';
+        }
+
+        const std::string tmp = path_ + ".tmp." + std::to_string(getpid());
+        int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+        struct stat st;
+        bool ok = fd >= 0 && fchmod(fd, mode) == 0 && WriteAll(fd, updated) && fsync(fd) == 0 && fstat(fd, &st) == 0;
+        err = errno;
+        if (fd >= 0) {
+            close(fd);
+        }
+        if (!ok || rename(tmp.c_str(), path_.c_str()) != 0) {
+            err = ok ? errno : err;
+            OLOG_AS(ANDROID_LOG_ERROR, "SetSysProperity", "%s write %s failed, err:%s", path_.c_str(), strerror(err));
+            unlink(tmp.c_str());
+            return false;
+        }
+        stamp_ = StampOf(st);
+        Parse(updated);
+        return true;
+    }
+
+    std::mutex mutex_;
+    std::string path_;
+    Stamp stamp_;
+    int lastReadErrno_ = 0;
+    std::string warnedMalformed_;
+    std::map<std::string, std::string> values_;
+};
+
+}  // namespace
+
+std::string SysEnv::GetSysProperity(const std::string& key, const std::string& defaultValue) {
+    return HostPropertyStore::Get().Read(key, defaultValue);
+}
+
+bool SysEnv::SetSysProperity(const std::string& key, const std::string& value) {
+    return SysEnv::CheckProperty(key, value) && HostPropertyStore::Get().Write(key, value);
+}
+
+}  // namespace Orvane
+}  // namespace android
