@@ -8,6 +8,7 @@
 #include "platform/event.h"
 #include "platform/event_loop.h"
 #include "platform/plugin.h"
+#include "utils/daemon_stats.h"
 
 namespace android {
 namespace Orvane {
@@ -48,6 +49,8 @@ public:
     virtual bool RegisterPipelineListener(const std::string& pipelineName, sp<Plugin> listener) = 0;
     // Where configuration pushed from the cloud is kept; normalised like "-cloudCfgDir".
     virtual void SetCloudConfigFolder(const std::string& folder) = 0;
+    // The daemon's statistics about itself; lives as long as the context.
+    virtual DaemonStats& GetStats() = 0;
 };
 
 }  // namespace Orvane

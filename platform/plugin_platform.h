@@ -73,6 +73,7 @@ public:
     bool InsertEventToPipeline(const std::string& pipelineName, sp<Event> event) override;
     bool RegisterPipelineListener(const std::string& pipelineName, sp<Plugin> listener) override;
     void SetCloudConfigFolder(const std::string& folder) override;
+    DaemonStats& GetStats() override { return stats_; }
 
     // Read access for dumps: copies, safe at any time.
     std::map<std::string, sp<Plugin>> GetPlugins();
@@ -94,6 +95,7 @@ private:
     sp<Pipeline> FindPipeline(const std::string& name);
 
     std::atomic<bool> isReady_{false};
+    DaemonStats stats_;
     std::string configDir_ = "/system/etc/orvane/";
     std::string cloudConfigDir_ = "/data/quorlog/orvane/config/";
     std::string workDir_ = "/data/quorlog/orvane/";

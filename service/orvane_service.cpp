@@ -95,8 +95,11 @@ void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
         DumpPluginSummaryInfo(fd);
     } else if (args.size() >= 2 && args[0] == "plugin") {
         DumpPluginInfo(fd, args[1], std::vector<std::string>(args.begin() + 2, args.end()));
+    } else if (args[0] == "stats") {
+        std::string text = platform_->GetStats().Format();
+        dprintf(fd, "%s", text.c_str());
     } else {
-        dprintf(fd, "usage: dump [plugin NAME [ARGS...]]\n");
+        dprintf(fd, "usage: dump [stats | plugin NAME [ARGS...]]\n");
     }
 }
 

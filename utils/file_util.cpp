@@ -240,6 +240,16 @@ int32_t DeleteDirectoryOrFile(const std::string& path, uint64_t& total, bool rem
     return 0;
 }
 
+FileStamp StampOf(const struct stat& st) {
+    return {st.st_dev, st.st_ino, st.st_size,
+            static_cast<int64_t>(st.st_mtim.tv_sec) * 1000000000 + st.st_mtim.tv_nsec};
+}
+
+FileStamp GetFileStamp(const std::string& path) {
+    struct stat st;
+    return stat(path.c_str(), &st) == 0 ? StampOf(st) : FileStamp();
+}
+
 }  // namespace FileUtil
 }  // namespace Orvane
 }  // namespace android

@@ -1,6 +1,7 @@
 #ifndef ORVANE_UTILS_FILE_UTIL_H
 #define ORVANE_UTILS_FILE_UTIL_H
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -8,6 +9,21 @@
 
 namespace android {
 namespace Orvane {
+
+// What identifies one version of a file: a reader that keeps what it parsed rereads the file
+// only when the stamp changes (a rename into place, a rewrite, a touch).
+struct FileStamp {
+    dev_t device = 0;
+    ino_t inode = 0;
+    off_t size = -1;
+    int64_t mtimeNs = -1;
+
+    bool operator==(const FileStamp& o) const {
+        return device == o.device && inode == o.inode && size == o.size && mtimeNs == o.mtimeNs;
+    }
+    bool operator!=(const FileStamp& o) const { return !(*this == o); }
+};
+
 namespace FileUtil {
 
 // Stateless helpers for files and folders, safe to call from any thread. Failures are reported
@@ -35,6 +51,9 @@ bool IsFileLatest(const std::string& pathA, const std::string& pathB);
 // its files, of every subfolder and of the folder itself are added to `total`. With
 // `removeSelf` false an emptied folder is kept.
 int32_t DeleteDirectoryOrFile(const std::string& path, uint64_t& total, bool removeSelf);
+// The stamp of the file at path, following links; the empty stamp (size -1) when it is missing.
+FileStamp GetFileStamp(const std::string& path);
+FileStamp StampOf(const struct stat& st);
 
 }  // namespace FileUtil
 }  // namespace Orvane

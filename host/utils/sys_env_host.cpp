@@ -14,6 +14,7 @@
 #include <map>
 #include <mutex>
 
+#include "utils/file_util.h"
 #include "utils/orvane_log.h"
 #include "utils/string_util.h"
 
@@ -117,16 +118,6 @@ public:
     }
 
 private:
-    struct Stamp {
-        dev_t device = 0;
-        ino_t inode = 0;
-        off_t size = -1;
-        int64_t mtimeNs = -1;
-        bool operator==(const Stamp& o) const {
-            return device == o.device && inode == o.inode && size == o.size && mtimeNs == o.mtimeNs;
-        }
-    };
-
     HostPropertyStore() {
         const char* path = getenv("ORVANE_PROPERTY_FILE");
         if (path != nullptr) {
@@ -134,20 +125,15 @@ private:
         }
     }
 
-    static Stamp StampOf(const struct stat& st) {
-        return {st.st_dev, st.st_ino, st.st_size,
-                static_cast<int64_t>(st.st_mtim.tv_sec) * 1000000000 + st.st_mtim.tv_nsec};
-    }
-
     // Reads the file when it changed since the last parse. A missing file holds no properties;
     // an unreadable one is reported once and read as empty; neither stops the caller.
     void RefreshLocked() {
         struct stat st;
-        if (stat(path_.c_str(), &st) == 0 && StampOf(st) == stamp_) {
+        if (stat(path_.c_str(), &st) == 0 && FileUtil::StampOf(st) == stamp_) {
             return;
         }
         std::string text;
-        Stamp stamp;
+        FileStamp stamp;
         int err = ReadFile(text, stamp, nullptr);
         if (err != 0 && err != ENOENT) {
             if (err != lastReadErrno_) {
@@ -167,7 +153,7 @@ private:
 
     // Opens and reads the property file; 0 or the error number. `stamp` (and `mode` when
     // asked) describe the version read; a missing file gives an empty text.
-    int ReadFile(std::string& text, Stamp& stamp, mode_t* mode) {
+    int ReadFile(std::string& text, FileStamp& stamp, mode_t* mode) {
         int fd = open(path_.c_str(), O_RDONLY | O_CLOEXEC);
         if (fd < 0) {
             return errno;
@@ -177,7 +163,7 @@ private:
         if (fstat(fd, &st) != 0 || !ReadAll(fd, text)) {
             err = errno;
         } else {
-            stamp = StampOf(st);
+            stamp = FileUtil::StampOf(st);
             if (mode != nullptr) {
                 *mode = st.st_mode & 07777;
             }
@@ -218,7 +204,7 @@ private:
     // sets the key on its own line (in place, or appended), and renames the new text over it.
     bool WriteLocked(const std::string& key, const std::string& value) {
         std::string text;
-        Stamp stamp;
+        FileStamp stamp;
         mode_t mode = 0644;
         int err = ReadFile(text, stamp, &mode);
         if (err != 0 && err != ENOENT) {
@@ -258,14 +244,14 @@ private:
             unlink(tmp.c_str());
             return false;
         }
-        stamp_ = StampOf(st);
+        stamp_ = FileUtil::StampOf(st);
         Parse(updated);
         return true;
     }
 
     std::mutex mutex_;
     std::string path_;
-    Stamp stamp_;
+    FileStamp stamp_;
     int lastReadErrno_ = 0;
     std::string warnedMalformed_;
     std::map<std::string, std::string> values_;

@@ -57,6 +57,7 @@ public:
     }
     bool RegisterPipelineListener(const std::string&, sp<Plugin>) override { return false; }
     void SetCloudConfigFolder(const std::string&) override {}
+    DaemonStats& GetStats() override { return stats_; }
 
     const std::string workDir_, configDir_;
     const std::map<std::string, std::string> devices_;
@@ -64,6 +65,7 @@ public:
     std::mutex mutex_;
     std::map<std::string, std::string> properties_;
     std::vector<std::pair<std::string, sp<Event>>> inserted_;
+    DaemonStats stats_;
 };
 
 }  // namespace android::Orvane
