@@ -1,11 +1,13 @@
 # Entry points: `make demo` runs the daemon's main job on this host; `make test` installs what is
-# missing, checks the style, builds and runs every test, and builds the tree again with clang,
-# whose thread-safety analysis checks the locking annotations. `make asan` / `make tsan` run the
-# tests under the sanitizers in their own build folders.
+# missing, checks the style, builds and runs every test, builds the tree again with clang, whose
+# thread-safety analysis checks the locking annotations, and runs every fuzzer briefly.
+# `make asan` / `make tsan` run the tests under the sanitizers in their own build folders;
+# `make fuzz` runs every fuzzer for FUZZ_SECONDS (600) each.
 BUILD ?= build
 JOBS ?= $(shell nproc)
+FUZZ_SECONDS ?= 600
 
-.PHONY: deps build demo test clang asan tsan clean
+.PHONY: deps build demo test clang fuzz asan tsan clean
 
 deps:
 	bash scripts/install-deps.sh
@@ -19,6 +21,10 @@ demo: build
 
 test: build clang
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
+	bash scripts/fuzz.sh 20
+
+fuzz: deps
+	bash scripts/fuzz.sh $(FUZZ_SECONDS)
 
 # clang with -Wthread-safety -Werror, then the naming rules over its compile database.
 clang: deps
@@ -36,4 +42,4 @@ tsan:
 	cd build-tsan && ctest --output-on-failure -j $(JOBS)
 
 clean:
-	rm -rf build build-asan build-tsan build-clang
+	rm -rf build build-asan build-tsan build-clang build-fuzz

@@ -1,6 +1,6 @@
 // libFuzzer target: bytes as a client would send them on the service socket, decoded frame by
 // frame and run through the service's transaction code (interface check, parcel reads, status
-// replies, dump arguments). Built and run by run_request_fuzzer.sh.
+// replies, dump arguments).
 
 #include <cstddef>
 #include <cstdint>
