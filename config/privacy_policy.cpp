@@ -60,7 +60,7 @@ public:
     PolicyReader() : XmlParser(PrivacyPolicyParser::kFileName), policy_(std::make_shared<PrivacyPolicy>()) {}
 
     std::shared_ptr<PrivacyPolicy> Read(const std::string& path, std::string& error) {
-        int64_t size = FileUtil::GetFileSize(path);
+        int64_t size = FileUtil::GetFileStamp(path).size;
         if (size < 0) {
             error = "missing";
         } else if (size > kMaxDocumentSize) {
@@ -313,7 +313,7 @@ std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const std::s
         }
     } else {
         OLOGE("%s privacy policy %s refused (%s), %s stays in force", choice.path.c_str(), error.c_str(),
-              current_ != nullptr ? current_->source.c_str() : "the safest policy");
+              current_ != nullptr ? "the policy read before" : "the safest policy");
         if (stats != nullptr) {
             stats->Add("privacy.policy.refused");
         }
