@@ -38,10 +38,12 @@ std::string DropReason(PrivacyCounters::Reason reason) {
     return std::string("privacy.") + (PrivacyCounters::kNames[reason] + strlen("privacy.dropped."));
 }
 
-// True when the text's brackets nest at most `limit` deep. Strings are skipped the way JsonCpp
-// reads them, so the count is never below the depth JsonCpp would reach: JsonCpp recurses once
-// per level and past its stack limit throws (aborts, on a device without exceptions).
-bool NestingWithin(const std::string& text, size_t limit) {
+// True when the text's brackets nest at most `limit` deep and it holds no comment. Strings are
+// skipped the way JsonCpp reads them, so the count is never below the depth JsonCpp would reach:
+// JsonCpp recurses once per level and past its stack limit throws (aborts, on a device without
+// exceptions). Comments are refused because JsonCpp skips them even in strict mode, and a text
+// the rules leave untouched is stored as it came: a comment would carry anything past them.
+bool IsPlainWithin(const std::string& text, size_t limit) {
     size_t depth = 0;
     bool inString = false;
     for (size_t i = 0; i < text.size(); ++i) {
@@ -60,6 +62,8 @@ bool NestingWithin(const std::string& text, size_t limit) {
             }
         } else if ((c == '}' || c == ']') && depth > 0) {
             --depth;
+        } else if (c == '/') {
+            return false;
         }
     }
     return true;
@@ -255,7 +259,7 @@ ParamFilter::Verdict ParamFilter::Apply(const PrivacyPolicy& policy, bool consen
 
 bool ParamFilter::ParseObject(const std::string& text, Json::Value& root) {
     size_t first = text.find_first_not_of(" \t\r\n");
-    if (first == std::string::npos || text[first] != '{' || !NestingWithin(text, kMaxNesting)) {
+    if (first == std::string::npos || text[first] != '{' || !IsPlainWithin(text, kMaxNesting)) {
         return false;
     }
     return reader_->parse(text.data(), text.data() + text.size(), &root, nullptr) && root.isObject();

@@ -83,7 +83,8 @@ public:
 private:
     enum class Check { kOk, kWrongType, kTooDeep, kUnknownClass };
 
-    // Parses `text` into `root`; false when it is not a JSON object within kMaxNesting.
+    // Parses `text` into `root`; false when it is not a JSON object within kMaxNesting, or holds
+    // a comment.
     bool ParseObject(const std::string& text, Json::Value& root);
     bool IsFilteredProcess(const PrivacyPolicy& policy, const Json::Value& root) const;
     void FilterObject(const EventInfoConfig& entry, Json::Value& object, int depth);

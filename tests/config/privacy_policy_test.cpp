@@ -82,9 +82,9 @@ TEST_F(PrivacyPolicyTest, BadDocumentsLeaveThePolicyInForce) {
     ASSERT_TRUE(WriteStringToFile("<PrivacyPolicy><Levels switchOn=\"L9\" switchOff=\"1\"/></PrivacyPolicy>", path));
     EXPECT_EQ(Get(), PrivacyPolicy::Safest());
 
-    ASSERT_TRUE(WriteStringToFile(Policy("<Levels switchOn=\"4\" switchOff=\"L2\"/>",
-                                         "<LogPaths><Allow prefix=\"/data/log\"/></LogPaths>"),
-                                  path));
+    ASSERT_TRUE(WriteStringToFile(
+            Policy("<Levels switchOn=\"4\" switchOff=\"L2\"/>", "<LogPaths><Allow prefix=\"/data/log\"/></LogPaths>"),
+            path));
     auto good = Get();
     ASSERT_NE(good, PrivacyPolicy::Safest());
     EXPECT_EQ(good->MaxLevel(true), 4u);
