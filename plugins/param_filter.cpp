@@ -285,7 +285,8 @@ void ParamFilter::FilterObject(const EventInfoConfig& entry, Json::Value& object
         }
     }
     for (const std::string& name : removed) {
-        object.removeMember(name);
+        // By range: the string overload stops at a NUL inside the name and would remove another.
+        object.removeMember(name.data(), name.data() + name.size(), nullptr);
     }
 }
 

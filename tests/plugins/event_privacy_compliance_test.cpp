@@ -192,6 +192,9 @@ TEST_F(EventPrivacyComplianceTest, UncheckedParametersFollowThePolicyAction) {
     EXPECT_EQ(Stat("stripped.bad_param_list"), std::size(bad));
     EXPECT_EQ(Stat("stripped.unknown_event"), 1u);
 
+    // A name with a NUL inside is still a name the catalogue does not list.
+    EXPECT_EQ(Run(kRich, R"({"reason\u0000x":"secret","pkg\u0000":"p","reason":"ok"})")->GetValue("param_list"),
+              R"({"reason":"ok"})");
     std::string huge = "{\"stack\":\"" + std::string(1 << 20, 'x') + "\",\"reason\":\"\xff\xfe\",\"\xc0\xaf\":1}";
     EXPECT_EQ(Run(kRich, huge)->GetValue("param_list"), "{\"stack\":\"" + std::string(64, 'x') + "\"}");
 
