@@ -52,13 +52,12 @@ EVENT_RET EventPrivacyCompliance::OnEvent(sp<Event>& event) {
         event->SetValue(kKeyDropReason, "privacy.not_loaded");
         return -1;
     }
-    std::shared_ptr<const PrivacyPolicy> policy = PrivacyPolicyParser::getInstance()->GetPolicy(*context);
-    catalogueDir_ = ConfigDocument::Choose(*context, kCatalogueFile).directory;
+    RefreshDocuments(*context);
     sp<EventInfoConfig> entry = EventXmlParser::getInstance()->GetEventInfoConfig(catalogueDir_, event->eventId);
     bool consented = DevInfo::GetUploadSwitch() == "on";
     std::string params = event->GetValue(kKeyParamList);
     std::string dropReason;
-    switch (filter_->Apply(*policy, consented, entry.get(), params, dropReason)) {
+    switch (filter_->Apply(*policy_, consented, entry.get(), params, dropReason)) {
         case ParamFilter::Verdict::kDropped:
             OLOGI_LIMITED("%s event %u dropped by %s", event->eventId, dropReason.c_str());
             event->SetValue(kKeyDropReason, dropReason);
@@ -70,6 +69,16 @@ EVENT_RET EventPrivacyCompliance::OnEvent(sp<Event>& event) {
             return 0;
     }
     return 0;
+}
+
+void EventPrivacyCompliance::RefreshDocuments(PluginContext& context) {
+    auto now = std::chrono::steady_clock::now();
+    if (policy_ != nullptr && now - documentsCheckedAt_ < kDocumentRecheck) {
+        return;
+    }
+    documentsCheckedAt_ = now;
+    policy_ = PrivacyPolicyParser::getInstance()->GetPolicy(context);
+    catalogueDir_ = ConfigDocument::Choose(context, kCatalogueFile).directory;
 }
 
 void EventPrivacyCompliance::Dump(int fd, const std::vector<std::string>&) {

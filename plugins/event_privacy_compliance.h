@@ -1,6 +1,7 @@
 #ifndef ORVANE_PLUGINS_EVENT_PRIVACY_COMPLIANCE_H
 #define ORVANE_PLUGINS_EVENT_PRIVACY_COMPLIANCE_H
 
+#include <chrono>
 #include <memory>
 #include <string>
 #include <vector>
@@ -19,7 +20,8 @@ namespace Orvane {
 // ends the pipeline (-1); a changed parameter list is written back as compact JSON; an event the
 // rules did not touch goes on exactly as it came. Everything is counted by reason.
 //
-// Threads: OnEvent runs on the plugin's loop, which owns the filter (checked at run time). Dump,
+// Threads: OnEvent runs on the plugin's loop, which owns the filter and the documents in use
+// (checked at run time). Dump,
 // from a binder thread, reads only the policy in force and the counters, both safe anywhere.
 class EventPrivacyCompliance : public Plugin {
 public:
@@ -27,11 +29,19 @@ public:
     EVENT_RET OnEvent(sp<Event>& event) override;
     void Dump(int fd, const std::vector<std::string>& args) override;
 
+    // How long the policy and the catalogue folder in use are kept before their files are
+    // looked at again (a few stats): a changed document reaches events within this time.
+    static constexpr std::chrono::milliseconds kDocumentRecheck{1000};
+
 private:
+    void RefreshDocuments(PluginContext& context);
+
     std::unique_ptr<PrivacyCounters> counters_;
     std::unique_ptr<ParamFilter> filter_;
-    // The catalogue folder of the event being filtered, for the lookups of nested classes.
+    // Loop-owned: the documents in use, and when they were last looked at.
+    std::shared_ptr<const PrivacyPolicy> policy_;
     std::string catalogueDir_;
+    std::chrono::steady_clock::time_point documentsCheckedAt_;
     ThreadChecker loopThread_;
 };
 
