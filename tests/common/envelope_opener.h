@@ -7,13 +7,17 @@
 
 #include <openssl/bio.h>
 #include <openssl/evp.h>
-#include <openssl/kdf.h>
 #include <openssl/pem.h>
+#if defined(OPENSSL_IS_BORINGSSL)
+#include <openssl/hkdf.h>
+#else
+#include <openssl/kdf.h>
+#endif
 
 namespace android::Orvane {
 
 // The upload server's side of identifier envelopes, written apart from the daemon's code (on
-// OpenSSL's own HKDF) so that a test opening an envelope checks the format, not the code twice:
+// the library's own HKDF) so that a test opening an envelope checks the format, not the code twice:
 // Base64 of version 1 | ephemeral X25519 key (32) | nonce (12) | ciphertext | tag (16), key =
 // HKDF-SHA256(salt = ephemeral key | server key, info = "orvane identifier v1"), the first 45
 // bytes authenticated.
@@ -108,15 +112,21 @@ private:
                   EVP_PKEY_derive_set_peer(derive, ephemeral) == 1 && EVP_PKEY_derive(derive, shared, &sharedSize) == 1;
         EVP_PKEY_CTX_free(derive);
         EVP_PKEY_free(ephemeral);
-        EVP_PKEY_CTX* hkdf = EVP_PKEY_CTX_new_id(EVP_PKEY_HKDF, nullptr);
         static const char kInfo[] = "orvane identifier v1";
+        const auto* info = reinterpret_cast<const unsigned char*>(kInfo);
+#if defined(OPENSSL_IS_BORINGSSL)
+        ok = ok &&
+             HKDF(aesKey, 32, EVP_sha256(), shared, sizeof(shared), salt, sizeof(salt), info, sizeof(kInfo) - 1) == 1;
+#else
+        EVP_PKEY_CTX* hkdf = EVP_PKEY_CTX_new_id(EVP_PKEY_HKDF, nullptr);
         size_t keySize = 32;
         ok = ok && EVP_PKEY_derive_init(hkdf) == 1 && EVP_PKEY_CTX_set_hkdf_md(hkdf, EVP_sha256()) == 1 &&
              EVP_PKEY_CTX_set1_hkdf_salt(hkdf, salt, sizeof(salt)) == 1 &&
              EVP_PKEY_CTX_set1_hkdf_key(hkdf, shared, sizeof(shared)) == 1 &&
-             EVP_PKEY_CTX_add1_hkdf_info(hkdf, reinterpret_cast<const unsigned char*>(kInfo), sizeof(kInfo) - 1) == 1 &&
+             EVP_PKEY_CTX_add1_hkdf_info(hkdf, info, sizeof(kInfo) - 1) == 1 &&
              EVP_PKEY_derive(hkdf, aesKey, &keySize) == 1;
         EVP_PKEY_CTX_free(hkdf);
+#endif
         return ok;
     }
 

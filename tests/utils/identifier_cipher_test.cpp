@@ -50,7 +50,12 @@ TEST(IdentifierCipherTest, OnlyTheServerKeyOpensAndEveryEnvelopeIsFresh) {
 TEST(IdentifierCipherTest, RefusesAnythingButAnX25519PublicKey) {
     std::string publicPem, privatePem;
     EnvelopeOpener::MakeKeyPair(publicPem, privatePem);
-    EVP_PKEY* ec = EVP_EC_gen("P-256");
+    EVP_PKEY* ec = nullptr;
+    EVP_PKEY_CTX* ctx = EVP_PKEY_CTX_new_id(EVP_PKEY_EC, nullptr);
+    ASSERT_TRUE(EVP_PKEY_keygen_init(ctx) == 1 &&
+                EVP_PKEY_CTX_set_ec_paramgen_curve_nid(ctx, NID_X9_62_prime256v1) == 1 &&
+                EVP_PKEY_keygen(ctx, &ec) == 1);
+    EVP_PKEY_CTX_free(ctx);
     BIO* bio = BIO_new(BIO_s_mem());
     PEM_write_bio_PUBKEY(bio, ec);
     char* data = nullptr;
