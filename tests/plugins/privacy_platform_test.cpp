@@ -53,33 +53,37 @@ TEST(PrivacyPlatformTest, OnlyWhatThePolicyAllowsIsStored) {
     platform->RegisterPipelineListener("dftFaultEvent", PrivacyTestSource::running_.load());
 
     uint64_t day = static_cast<uint64_t>(TimeUtil::GetZeroTimestampSec(TimeUtil::GetTimestampSecond()));
-    auto publish = [&](uint32_t id, const std::string& params) {
-        PrivacyTestSource::running_.load()->PublishPipelineEvent(MakeEvent(2, id, day + 60, params));
+    auto publish = [&](uint32_t id, const std::string& params, uint64_t at = 60) {
+        PrivacyTestSource::running_.load()->PublishPipelineEvent(MakeEvent(2, id, day + at, params));
     };
     const std::string longReason(300, 'r');
-    publish(901001001, R"({"reason":")" + longReason + R"(","uptime":5120,"user":"alice"})");
+    for (int i = 0; i < 4; ++i) {  // the fourth goes over the daily quota of 3: storage's own report follows
+        publish(901001001, R"({"reason":")" + longReason + R"(","uptime":5120,"user":"alice"})", 60 + 4000 * i);
+    }
     publish(902001002, R"({"pkg":"com.android.providers.contacts","anrReason":"timeout"})");
     publish(905002001, R"({"device":"ufs0","lifeUsed":"30%","serial":"UFS-0042"})");
     publish(903000001, R"({"anything":"at all"})");
     publish(905001001, R"({"device":"sda","errno":5,"sector":123456})");
     DaemonStats& stats = platform->GetStats();
-    ASSERT_TRUE(WaitUntil([&] {
-        return PrivacyTestSource::finished_ == 4 && stats.Value("privacy.dropped.filter_list") == 1;
-    }));
+    ASSERT_TRUE(WaitUntil(
+            [&] { return PrivacyTestSource::finished_ == 8 && stats.Value("privacy.dropped.filter_list") == 1; }));
     DevInfo::SetUploadSwitch(0);  // without consent, an L3 event is not kept at all
     publish(902001001, R"({"pkg":"com.example","exception":"NPE"})");
     ASSERT_TRUE(WaitUntil([&] { return stats.Value("privacy.dropped.event_level") == 1; }));
 
-    Texts rows = Column(root.File("work/event.db"), "select event_id||' '||param_list from event_info order by event_id");
-    ASSERT_EQ(rows.size(), 4u) << ::testing::PrintToString(rows);
+    Texts rows =
+            Column(root.File("work/event.db"), "select event_id||' '||param_list from event_info order by event_id");
+    ASSERT_EQ(rows.size(), 5u) << ::testing::PrintToString(rows);
     EXPECT_EQ(rows[0], "901001001 {\"reason\":\"" + longReason.substr(0, 128) + "\",\"uptime\":5120}");
     EXPECT_EQ(rows[1], "903000001 {}");
     EXPECT_EQ(rows[2], R"(905001001 {"device":"sda","errno":5,"sector":123456})");
+    EXPECT_EQ(rows[4], R"(908001001 {"EventId":901001001,"DailyCnt":3,"MaxCnt":3})");
     Json::Value sealed;
     ASSERT_TRUE(Json::Reader().parse(rows[3].substr(10), sealed)) << rows[3];
     EXPECT_EQ(rows[3].rfind(R"(905002001 {"device":"ufs0","lifeUsed":0,"serial":")", 0), 0u) << rows[3];
     std::string serial;
-    EnvelopeOpener server(ReadFile(std::string(ORVANE_SOURCE_DIR) + "/tests/common/privacy_test_server_private_key.pem"));
+    EnvelopeOpener server(
+            ReadFile(std::string(ORVANE_SOURCE_DIR) + "/tests/common/privacy_test_server_private_key.pem"));
     ASSERT_TRUE(server.Open(sealed["serial"].asString(), serial));
     EXPECT_EQ(serial, "UFS-0042");
     EXPECT_EQ(stats.Value("privacy.encrypted"), 1u);
