@@ -46,13 +46,10 @@ TEST_F(PrivacyPolicyTest, ShippedPolicy) {
     EXPECT_EQ(policy->MaxLevel(false), 2u);
     EXPECT_EQ(policy->unchecked, UncheckedAction::kStrip);
     EXPECT_NE(policy->cipher, nullptr);
-    EventParamInfoCfg serial, level4, plain;
-    serial.name = "serial";
-    level4.name = "x", level4.privacyLevel = 4;
-    plain.name = "x", plain.privacyLevel = 5;
-    EXPECT_TRUE(policy->IsIdentifier(serial));
-    EXPECT_TRUE(policy->IsIdentifier(level4));
-    EXPECT_FALSE(policy->IsIdentifier(plain));
+    EventParamInfoCfg byName, byLevel, unmarked;  // unmarked parameters have level 5
+    byName.name = "serial", byLevel.privacyLevel = 4;
+    EXPECT_TRUE(policy->IsIdentifier(byName) && policy->IsIdentifier(byLevel));
+    EXPECT_FALSE(policy->IsIdentifier(unmarked));
     EXPECT_TRUE(policy->IsFiltered("com.android.providers.contacts"));
     EXPECT_TRUE(policy->IsFiltered("com.quor.wallet:pay"));
     EXPECT_FALSE(policy->IsFiltered("com.android.providers.contacts2"));

@@ -1,6 +1,6 @@
 #include "utils/identifier_cipher.h"
 
-#include <set>
+#include <atomic>
 #include <thread>
 #include <vector>
 
@@ -89,29 +89,21 @@ TEST(IdentifierCipherTest, SealsConcurrently) {
     EnvelopeOpener::MakeKeyPair(publicPem, privatePem);
     std::shared_ptr<const IdentifierCipher> cipher = IdentifierCipher::FromPem(publicPem);
     ASSERT_NE(cipher, nullptr);
-    std::vector<std::vector<std::string>> sealed(4);
+    EnvelopeOpener server(privatePem);
+    std::atomic<int> opened{0};
     std::vector<std::thread> threads;
-    for (size_t t = 0; t < sealed.size(); ++t) {
+    for (int t = 0; t < 4; ++t) {
         threads.emplace_back([&, t] {
             for (int i = 0; i < 50; ++i) {
-                sealed[t].push_back(cipher->Seal("id-" + std::to_string(t) + "-" + std::to_string(i)));
+                std::string value = "id-" + std::to_string(t * 100 + i), plain;
+                opened += server.Open(cipher->Seal(value), plain) && plain == value ? 1 : 0;
             }
         });
     }
     for (std::thread& thread : threads) {
         thread.join();
     }
-    EnvelopeOpener server(privatePem);
-    std::set<std::string> distinct;
-    for (size_t t = 0; t < sealed.size(); ++t) {
-        for (int i = 0; i < 50; ++i) {
-            std::string opened;
-            ASSERT_TRUE(server.Open(sealed[t][i], opened));
-            EXPECT_EQ(opened, "id-" + std::to_string(t) + "-" + std::to_string(i));
-            distinct.insert(sealed[t][i]);
-        }
-    }
-    EXPECT_EQ(distinct.size(), 200u);
+    EXPECT_EQ(opened, 200);
 }
 
 }  // namespace
