@@ -192,8 +192,9 @@ PrivacyCounters::PrivacyCounters(DaemonStats& stats) {
 
 ParamFilter::ParamFilter(PrivacyCounters& counters, ClassLookup lookup)
     : counters_(counters), lookup_(std::move(lookup)) {
-    // Strict: no comments, no trailing text, and no repeated names, since the stored text would
-    // keep a first occurrence that only the last one was checked for.
+    // Strict: no trailing text and no repeated names, since the stored text would keep a first
+    // occurrence that only the last one was checked for. (Comments, which JsonCpp skips even so,
+    // never get here: IsPlainWithin refuses them.)
     Json::CharReaderBuilder readerBuilder;
     Json::CharReaderBuilder::strictMode(&readerBuilder.settings_);
     reader_.reset(readerBuilder.newCharReader());
