@@ -80,6 +80,16 @@ xmlParserCtxtPtr CreatePushParser(xmlSAXHandler& handler, XmlParser* parser, con
     return ctxt;
 }
 
+// Frees the parser and the document libxml2 builds on its own for a DOCTYPE that declares
+// entities, which freeing the parser alone leaves behind.
+void FreePushParser(xmlParserCtxtPtr ctxt) {
+    if (ctxt->myDoc != nullptr) {
+        xmlFreeDoc(ctxt->myDoc);
+        ctxt->myDoc = nullptr;
+    }
+    xmlFreeParserCtxt(ctxt);
+}
+
 // The trace section's name, built only while tracing is on.
 std::string TraceName(const char* op, const std::string& path) {
     return ScopedTrace::IsTraceEnabled() ? op + path : std::string();
@@ -157,7 +167,7 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     };
     char buffer[kBlockSize];
     bool extracted = reader.ExtractFile(entryName, buffer, sizeof(buffer), consumer);
-    xmlFreeParserCtxt(ctxt);
+    FreePushParser(ctxt);
     xmlCleanupParser();
     reader.Close();
     if (extracted && !entrySeen) {
@@ -205,7 +215,7 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
             break;
         }
     }
-    xmlFreeParserCtxt(ctxt);
+    FreePushParser(ctxt);
     xmlCleanupParser();
     return result;
 }

@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # The daemon's main job on a host, end to end: kernel records written to emulated device
-# nodes become events that are counted, paced and stored in event.db under the shipped
-# quotas. Starts orvane-devsim and the daemon in a sandbox folder, writes a stream of records,
+# nodes become events that the privacy policy filters and that are counted, paced and stored in
+# event.db under the shipped quotas. Starts orvane-devsim and the daemon in a sandbox folder, writes a stream of records,
 # shows what was stored and what was dropped and why, then stops everything it started.
 # Assumes `make build` has run. BUILD names the build folder (default: build);
 # ORVANE_DEMO_KEEP=1 keeps the sandbox folder for a look afterwards.
@@ -43,6 +43,7 @@ cat > "$ORVANE_PROPERTY_FILE" <<'EOF'
 ro.quor.build.region=CN
 ro.quor.build.type=1
 ro.serialno=DEMO0001
+persist.sys.orvane.upload_switch=1
 EOF
 
 DEVSIM_PID=
@@ -132,10 +133,21 @@ run_demo() {
     # Faults of three domains (kernel 901, framework 902, storage 905), well spaced, within quota.
     fault 901001001 $((MIDNIGHT + 3600)) '{"reason":"wlan firmware crash","uptime":5120}'
     fault 901001002 $((MIDNIGHT + 3700)) '{"task":"kworker/2:1","blockedSec":120}'
-    fault 902001001 $((MIDNIGHT + 3800)) '{"pkg":"com.android.phone","versionCode":33,"exception":"NullPointerException"}'
     fault 905001001 $((MIDNIGHT + 3900)) '{"device":"sda","errno":5,"sector":123456}'
     fault 905001001 $((MIDNIGHT + 9000)) '{"device":"sda","errno":5,"sector":123456}'
-    echo "5 faults of the kernel, framework and storage domains"
+    echo "4 faults of the kernel and storage domains"
+
+    # The privacy policy at work (the upload switch is on: the user agreed to uploads).
+    # A crash report with a stack longer than the catalogue's 256 bytes and a member the
+    # catalogue does not list: stored cut, without the member.
+    local stack="java.lang.NullPointerException: Attempt to invoke a virtual method on a null object reference"
+    stack="$stack$(printf ' at com.android.phone.CallNotifier.onNewRingingConnection(CallNotifier.java:%d)' 101 102 103)"
+    fault 902001001 $((MIDNIGHT + 3800)) '{"pkg":"com.android.phone","versionCode":33,"exception":"'"$stack"'","userName":"alice"}'
+    # An ANR of the contacts provider, which the filter list names: dropped.
+    fault 902001002 $((MIDNIGHT + 3850)) '{"pkg":"com.android.providers.contacts","anrReason":"Input dispatching timed out"}'
+    # A storage health report with the chip's serial number, an identifier: sealed for the server.
+    fault 905002001 $((MIDNIGHT + 3950)) '{"device":"ufs0","lifeUsed":30,"serial":"UFS-0042-7731"}'
+    echo "3 faults for the privacy policy: one to cut, one of a filtered package, one with an identifier"
 
     # The same wlan crash again and again, two hours apart: each opens a new hour period, so only
     # its daily quota (3 in event_quota.xml) stops it.
@@ -170,7 +182,11 @@ run_demo() {
     # The daemon's writes take no busy time-out, so nothing reads its database while it runs:
     # progress is read from copies, the results after it has stopped.
     SNAPSHOT=$SANDBOX/snapshot.db
-    drops() { grep -c "over daily cnt drop it\|over hour cnt drop it" "$LOG" || true; }
+    privacy_drops() { # events the privacy policy dropped, from the daemon's statistics
+        "$BUILD/orvanectl" --workdir "$WORK" dump stats 2> /dev/null |
+            awk '$1 ~ /^privacy\.dropped\./ {n += $2} END {print n + 0}'
+    }
+    drops() { echo $(($(grep -c "over daily cnt drop it\|over hour cnt drop it" "$LOG" || true) + $(privacy_drops))); }
     stored() { # kept fault occurrences of the domains written above
         cp "$DB" "$SNAPSHOT" 2> /dev/null &&
             sqlite3 "$SNAPSHOT" "select coalesce(sum(occured_cnt), 0) from event_info
@@ -187,6 +203,10 @@ run_demo() {
     if [ -x "$BUILD/orvanectl" ] && [ -S "$WORK/orvane.sock" ]; then
         section "orvanectl dump plugin EventStorageManager query event_daily"
         "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventStorageManager query event_daily || true
+        section "orvanectl dump plugin EventPrivacyCompliance"
+        "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventPrivacyCompliance || true
+        section "orvanectl dump stats"
+        "$BUILD/orvanectl" --workdir "$WORK" dump stats | tee "$SANDBOX/stats.txt" || true
     fi
 
     section "stopping the daemon and the emulator"
@@ -198,6 +218,17 @@ run_demo() {
         "select event_id, count(*) as rows, sum(occured_cnt) as occurrences from event_info group by event_id order by event_id;"
     echo "(908001001 is the daemon's own report of an event that went over its daily quota)"
 
+    section "what the privacy policy did"
+    echo "902001001 as written:"
+    echo "  {\"pkg\":\"com.android.phone\",\"versionCode\":33,\"exception\":\"(${#stack} bytes)\",\"userName\":\"alice\"}"
+    echo "902001001 as stored (exception cut to 256 bytes, userName removed):"
+    sqlite3 "$DB" "select '  ' || param_list from event_info where event_id = 902001001;"
+    echo "902001002 of com.android.providers.contacts: $(grep -o "event 902001002 dropped by [a-z_.]*" "$LOG" | head -1)"
+    echo "  stored rows of it: $(sqlite3 "$DB" "select count(*) from event_info where event_id = 902001002
+        and param_list like '%providers.contacts%';")"
+    echo "905002001 as stored (serial sealed for the upload server):"
+    sqlite3 "$DB" "select '  ' || param_list from event_info where event_id = 905002001;"
+
     section "today's counters (event_daily)"
     sqlite3 -header -column "$DB" \
         "select event_id, daily_cnt, over_cnt, hour_cnt from event_daily order by event_id;"
@@ -207,6 +238,8 @@ run_demo() {
         grep -o "event [0-9]* over daily cnt" "$LOG" | awk '{print $2, "over daily quota"}'
         grep -o "event [0-9]* over hour cnt" "$LOG" | awk '{print $2, "event happen too sequence, drop it by punish"}'
     } | sort | uniq -c | awk '{c=$1; $1=""; printf "%6d x%s\n", c, $0}'
+    [ -f "$SANDBOX/stats.txt" ] && awk '$1 ~ /^privacy\.dropped\./ && $2 > 0 {
+        sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1}' "$SANDBOX/stats.txt"
     echo "$(grep -c "ParseEvent event invalid" "$LOG") records rejected by the source as invalid"
 }
 

@@ -8,6 +8,8 @@ packages=(
     libsqlite3-dev sqlite3 libxml2-dev libjsoncpp-dev libminizip-dev zlib1g-dev
     android-libutils-dev android-liblog-dev android-libcutils-dev android-libbase-dev
     android-platform-frameworks-native-headers
+    # libcrypto: OpenSSL for the host build, BoringSSL's headers for the device syntax check
+    libssl-dev android-libboringssl-dev
     zip unzip libfuse3-dev fuse3 clang libclang-rt-14-dev
 )
 

@@ -1,11 +1,15 @@
 #include "utils/zip_pack.h"
 
+#include <fcntl.h>
+#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+
+#include <android-base/unique_fd.h>
 
 #include "utils/file_util.h"
 #include "utils/orvane_log.h"
@@ -122,29 +126,40 @@ bool ZipPack::AddFileContentToZip(const std::string& path) {
     if (!FileUtil::FileExists(path)) {
         return false;
     }
-    FILE* file = fopen(path.c_str(), "rb");
-    if (file == nullptr) {
+    android::base::unique_fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (fd < 0) {
         OLOGI("%s open file %s failed", path.c_str());
         return false;
     }
+    return CopyToEntry(fd.get(), path);
+}
+
+bool ZipPack::AddFileFromFd(int fd, const std::string& entryName) {
+    if (zipHandle_ == nullptr || fd < 0 || !OpenNewFileInZip(zipHandle_, entryName)) {
+        return false;
+    }
+    // The entry is closed even when copying failed, leaving what was copied.
+    bool copied = CopyToEntry(fd, entryName);
+    return CloseNewFileEntry(zipHandle_) && copied;
+}
+
+bool ZipPack::CopyToEntry(int fd, const std::string& what) {
     char buffer[kCopyBufferSize];
-    bool ok = true;
-    while (!feof(file)) {
-        size_t n = fread(buffer, 1, sizeof(buffer), file);
-        if (n > 0 && zipWriteInFileInZip(zipHandle_, buffer, static_cast<unsigned>(n)) != ZIP_OK) {
-            OLOGI("%s Could not write data to zip for path:%s ", path.c_str());
-            ok = false;
-            break;
+    while (true) {
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buffer, sizeof(buffer)));
+        if (n == 0) {
+            return true;
         }
-        if (n < 1 && ferror(file)) {
+        if (n < 0) {
             // A read error never turns into end of file; keep what was copied so far.
-            OLOGI("%s read file %s failed", path.c_str());
-            ok = false;
-            break;
+            OLOGI("%s read file %s failed", what.c_str());
+            return false;
+        }
+        if (zipWriteInFileInZip(zipHandle_, buffer, static_cast<unsigned>(n)) != ZIP_OK) {
+            OLOGI("%s Could not write data to zip for path:%s ", what.c_str());
+            return false;
         }
     }
-    fclose(file);
-    return ok;
 }
 
 void ZipPack::Close() {

@@ -51,11 +51,17 @@ public:
     bool AddDirectoryEntryToZip(const std::string& entryName);
     // Copies the file's bytes into the entry that is currently open.
     bool AddFileContentToZip(const std::string& path);
+    // Writes the entry entryName at once from an open descriptor (read from its current offset),
+    // so that what is packed is the file that was opened and checked, whatever its path names now.
+    bool AddFileFromFd(int fd, const std::string& entryName);
     // Writes every pending path and finishes the archive; nothing when none is open.
     void Close();
 
 private:
     static constexpr size_t kBatchSize = 50;
+
+    // Copies everything readable from fd into the open entry; `what` names it in log lines.
+    bool CopyToEntry(int fd, const std::string& what);
 
     zipFile zipHandle_ = nullptr;
     std::deque<std::string> pending_;
