@@ -215,7 +215,11 @@ const char* ActionName(UncheckedAction action) {
 }  // namespace
 
 std::shared_ptr<const PrivacyPolicy> PrivacyPolicy::Safest() {
-    static const std::shared_ptr<const PrivacyPolicy> kSafest = std::make_shared<PrivacyPolicy>();
+    static const std::shared_ptr<const PrivacyPolicy> kSafest = [] {
+        auto safest = std::make_shared<PrivacyPolicy>();
+        safest->keepsEventsAboveLevel = true;
+        return safest;
+    }();
     return kSafest;
 }
 

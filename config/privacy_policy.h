@@ -27,8 +27,9 @@ enum class UncheckedAction { kKeep, kStrip, kDrop };
 // vocabulary). Built once by PrivacyPolicyParser and never changed afterwards, so any thread may
 // query it through the shared pointer it holds.
 struct PrivacyPolicy {
-    // The policy in force while no document could ever be read: nothing above level 1, no
-    // identifiers, unchecked parameters stripped, no log file collected.
+    // The policy in force while no document could ever be read: no parameter above level 1, no
+    // identifiers, unchecked parameters stripped, no log file collected. Events themselves are
+    // kept whatever their level, stripped: a document that cannot be read must not cost them.
     static std::shared_ptr<const PrivacyPolicy> Safest();
 
     // Highest parameter (and event) privacy level kept; `consented` is the upload switch "on".
@@ -46,6 +47,8 @@ struct PrivacyPolicy {
     uint32_t levelConsented = 1;
     uint32_t levelOtherwise = 1;
     UncheckedAction unchecked = UncheckedAction::kStrip;
+    // False for a read document: an event above MaxLevel is dropped. True only for Safest.
+    bool keepsEventsAboveLevel = false;
     // Identifiers: by name, and by privacy level (0: none by level). Without a cipher (no key
     // file, or one that is not an X25519 public key) they are withheld, never kept in the clear.
     std::set<std::string> identifierNames;

@@ -222,7 +222,7 @@ ParamFilter::Verdict ParamFilter::Apply(const PrivacyPolicy& policy, bool consen
         dropReason = DropReason(reason);
         return Verdict::kDropped;
     };
-    if (entry != nullptr && entry->privacyLevel > maxLevel_) {
+    if (entry != nullptr && entry->privacyLevel > maxLevel_ && !policy.keepsEventsAboveLevel) {
         return drop(PrivacyCounters::kDroppedEventLevel);
     }
     if (entry == nullptr && policy.unchecked == UncheckedAction::kDrop) {

@@ -225,6 +225,31 @@ TEST_F(EventPrivacyComplianceTest, UncheckedParametersFollowThePolicyAction) {
     EXPECT_EQ(Stat("dropped.unknown_event"), 2u);  // with the one that showed the change
 }
 
+// While no policy could ever be read, an event of any level is kept but carries nothing above
+// level 1: a broken document costs parameters, never events, and never lets one through.
+TEST(SafestPolicyTest, KeepsEveryEventWithOnlyLevelOneParameters) {
+    sp<EventInfoConfig> entry = new EventInfoConfig(kLevel3);
+    entry->privacyLevel = 3;
+    EventParamInfoCfg pkg, stack;
+    pkg.name = "pkg", pkg.type = PARAM_TYPE_STRING, pkg.privacyLevel = 1;
+    stack.name = "stack", stack.type = PARAM_TYPE_STRING, stack.privacyLevel = 3;
+    entry->params = {pkg, stack};
+    DaemonStats stats;
+    PrivacyCounters counters(stats);
+    ParamFilter filter(counters, [](uint32_t) { return sp<EventInfoConfig>(); });
+    for (bool consented : {true, false}) {
+        std::string params = R"({"pkg":"com.a","stack":"secret"})", dropReason;
+        EXPECT_EQ(filter.Apply(*PrivacyPolicy::Safest(), consented, entry.get(), params, dropReason),
+                  ParamFilter::Verdict::kRewritten);
+        EXPECT_EQ(params, R"({"pkg":"com.a"})");
+        EXPECT_EQ(dropReason, "");
+    }
+    std::string unknown = R"({"a":1})", dropReason;
+    EXPECT_EQ(filter.Apply(*PrivacyPolicy::Safest(), true, nullptr, unknown, dropReason),
+              ParamFilter::Verdict::kRewritten);
+    EXPECT_EQ(unknown, "{}");
+}
+
 // Events of a filtered process or package are dropped whichever parameter named in the policy
 // carries the name, exactly or by pattern, known to the catalogue or not.
 TEST_F(EventPrivacyComplianceTest, FilterListDropsEventsOfListedProcesses) {
