@@ -144,7 +144,8 @@ void PerfLogAnalyzer::Configure() {
         monitor_.Stop();
         results = monitor_.Arm(specs);
         // The monitor is stopped before this object goes, so the raw pointer stays valid.
-        monitor_.Start([this](const std::string& resource, const std::string& trigger) { OnFire(resource, trigger); });
+        monitor_.Start([this](const std::string& resource, const std::string& trigger) { OnFire(resource, trigger); },
+                       context->GetStats());
     }
     size_t armed = 0;
     std::vector<std::string> failures;
@@ -247,11 +248,7 @@ void PerfLogAnalyzer::FinishReport(const std::shared_ptr<Report>& report) {
     // The loop may run the second reading late: the event tells over how long the growth was.
     report->sampleMs = (TimeUtil::GetNanoSecondSinceSystemStart() - report->beforeNs) / 1000000;
     std::vector<TopProcess> top = sampler_.Top(report->resource, report->before, after, settings->topCount);
-    sp<Event> event = new Event("PerfLogAnalyzer");
-    event->eventType = kFaultEventType;
-    event->eventId = EventIdOf(report->resource);
-    event->happenTime = TimeUtil::GetTimestampSecond();
-    event->SetValue(kKeyParamList, BuildParamList(*report, top));
+    sp<Event> event = BuildEvent(*report, top);
     if (!context->InsertEventToPipeline(kPipeline, event)) {
         OLOGW_LIMITED("%s pipeline %s refused the %s pressure event", kPipeline, name);
         context->GetStats().Add(StatName("refused", name));
@@ -277,7 +274,7 @@ bool PerfLogAnalyzer::ReadPressure(PerfResource resource, Pressure& out) {
     return false;
 }
 
-std::string PerfLogAnalyzer::BuildParamList(const Report& report, const std::vector<TopProcess>& top) const {
+sp<Event> PerfLogAnalyzer::BuildEvent(const Report& report, const std::vector<TopProcess>& top) {
     Json::Value root(Json::objectValue);
     root["resource"] = ProcessSampler::ResourceName(report.resource);
     root["trigger"] = report.trigger;
@@ -301,7 +298,12 @@ std::string PerfLogAnalyzer::BuildParamList(const Report& report, const std::vec
         list.append(entry);
     }
     root["top"] = list;
-    return JsonUtil::ConvertJsonToStr(root);
+    sp<Event> event = new Event("PerfLogAnalyzer");
+    event->eventType = kFaultEventType;
+    event->eventId = EventIdOf(report.resource);
+    event->happenTime = TimeUtil::GetTimestampSecond();
+    event->SetValue(kKeyParamList, JsonUtil::ConvertJsonToStr(root));
+    return event;
 }
 
 std::string PerfLogAnalyzer::StatName(const char* what, const std::string& resource) const {

@@ -51,6 +51,18 @@ public:
     // The configuration update (event 104).
     void OnUnorderedEvent(sp<Event> event) override;
 
+    // One report, from the trigger's fire to its second sample.
+    struct Report {
+        PerfResource resource = PerfResource::kCpu;
+        std::string trigger;
+        Pressure pressure;
+        std::vector<ProcessValue> before;
+        int64_t beforeNs = 0;  // when `before` was read
+        int64_t sampleMs = 0;  // how long the growth was measured over
+    };
+    // The fault event of a report and its busiest processes.
+    static sp<Event> BuildEvent(const Report& report, const std::vector<TopProcess>& top);
+
 private:
     // What the dump shows of one resource.
     struct ResourceStatus {
@@ -59,16 +71,6 @@ private:
         uint32_t topCount = 0;
         Pressure last;  // of the last event
     };
-    // One report between its two samples.
-    struct Report {
-        PerfResource resource;
-        std::string trigger;
-        Pressure pressure;
-        std::vector<ProcessValue> before;
-        int64_t beforeNs = 0;  // when `before` was read
-        int64_t sampleMs = 0;  // how long the growth was measured over
-    };
-
     sp<EventLoop> WorkLoop();
     void PostToLoop(std::function<void(PerfLogAnalyzer&)> work);
     // Rereads the document and, when it changed, re-arms the triggers.
@@ -78,7 +80,6 @@ private:
     void FinishReport(const std::shared_ptr<Report>& report);
     const PerfResourceConfig* FindSettings(const std::string& resource) const;
     bool ReadPressure(PerfResource resource, Pressure& out);
-    std::string BuildParamList(const Report& report, const std::vector<TopProcess>& top) const;
     std::string StatName(const char* what, const std::string& resource) const;
 
     const std::string pressureDir_;

@@ -56,7 +56,7 @@ std::vector<std::string> PsiMonitor::Arm(const std::vector<PsiTriggerSpec>& spec
     return failures;
 }
 
-void PsiMonitor::Start(FireCallback callback) {
+void PsiMonitor::Start(FireCallback callback, DaemonStats& stats) {
     if (watcher_.joinable() || armed_.empty()) {
         return;
     }
@@ -66,6 +66,7 @@ void PsiMonitor::Start(FireCallback callback) {
         return;
     }
     callback_ = std::move(callback);
+    stats_ = &stats;
     watcher_ = std::thread([this] { Watch(); });
 }
 
@@ -142,6 +143,7 @@ void PsiMonitor::Watch() {
             Armed& armed = armed_[owners[k - 1]];
             if ((fds[k].revents & (POLLERR | POLLHUP | POLLNVAL)) != 0) {
                 armed.lost = true;
+                stats_->Add("perf.trigger_lost." + armed.spec.resource);
                 OLOGW("%s trigger \"%s\" of %s lost (events 0x%x), no longer watched", armed.spec.text.c_str(),
                       armed.spec.resource.c_str(), fds[k].revents);
                 continue;

@@ -9,6 +9,8 @@
 
 #include <android-base/unique_fd.h>
 
+#include "utils/daemon_stats.h"
+
 namespace android {
 namespace Orvane {
 
@@ -43,8 +45,9 @@ public:
     // Arms each trigger (the watcher must be stopped) and returns, for each, why it could not be
     // armed ("<file> \"<text>\": <error>"), or an empty string when it is armed.
     std::vector<std::string> Arm(const std::vector<PsiTriggerSpec>& specs);
-    // Starts the watcher over the armed triggers; nothing to watch starts nothing.
-    void Start(FireCallback callback);
+    // Starts the watcher over the armed triggers; nothing to watch starts nothing. A trigger the
+    // kernel reports an error on is no longer watched and counted in "perf.trigger_lost.<resource>".
+    void Start(FireCallback callback, DaemonStats& stats);
     // Stops the watcher and disarms every trigger.
     void Stop();
     bool IsRunning() const { return watcher_.joinable(); }
@@ -66,6 +69,7 @@ private:
     std::vector<int64_t> coolUntilNs_;
     android::base::unique_fd wakeFd_;
     FireCallback callback_;
+    DaemonStats* stats_ = nullptr;
     std::thread watcher_;
 };
 
