@@ -1,8 +1,10 @@
 #!/usr/bin/env bash
 # The daemon's main job on a host, end to end: kernel records written to emulated device
 # nodes become events that the privacy policy filters and that are counted, paced and stored in
-# event.db under the shipped quotas. Starts orvane-devsim and the daemon in a sandbox folder, writes a stream of records,
-# shows what was stored and what was dropped and why, then stops everything it started.
+# event.db under the shipped quotas. Starts orvane-devsim and the daemon in a sandbox folder,
+# writes a stream of records, shows what was stored and what was dropped and why, makes CPU
+# pressure that the kernel's pressure stall trigger turns into a performance event (where
+# triggers can be armed), then stops everything it started.
 # Assumes `make build` has run. BUILD names the build folder (default: build);
 # ORVANE_DEMO_KEEP=1 keeps the sandbox folder for a look afterwards.
 #
@@ -26,7 +28,7 @@ BUILD=$(cd "$ROOT" && cd "$BUILD_NAME" 2> /dev/null && pwd) || {
     echo "demo: build folder $BUILD_NAME not found; run 'make build' first" >&2
     exit 1
 }
-for tool in orvane orvane-devsim; do
+for tool in orvane orvane-devsim orvane-pressure; do
     if [ ! -x "$BUILD/$tool" ]; then
         echo "demo: $BUILD/$tool is missing; run 'make build' first" >&2
         exit 1
@@ -48,7 +50,13 @@ EOF
 
 DEVSIM_PID=
 DAEMON_PID=
+PRESSURE_PID=
 stop_processes() {
+    if [ -n "$PRESSURE_PID" ]; then
+        kill "$PRESSURE_PID" 2> /dev/null || true
+        wait "$PRESSURE_PID" 2> /dev/null || true
+        PRESSURE_PID=
+    fi
     if [ -n "$DAEMON_PID" ]; then
         kill "$DAEMON_PID" 2> /dev/null || true
         wait "$DAEMON_PID" 2> /dev/null || true
@@ -88,6 +96,19 @@ wait_for() {
 section() { printf '\n== %s\n' "$*"; }
 
 section "sandbox $SANDBOX"
+# Performance events: where this kernel takes pressure stall triggers, the demo loads
+# PerfLogAnalyzer 2 s after start instead of 30 and lets it fire on moderate CPU pressure (cloud
+# copies of the plugin configuration and of perf_config.xml, which take precedence).
+PERF=0
+PERF_PROBE=$("$BUILD/orvane-pressure" probe 2>&1) && PERF=1
+if [ "$MODE" = demo ] && [ "$PERF" = 1 ]; then
+    sed 's/^PerfLogAnalyzer\(.*\):30 static/PerfLogAnalyzer\1:2 static/' "$ROOT/etc/plugin_config" > "$SANDBOX/cloud/plugin_config"
+    cat > "$SANDBOX/cloud/perf_config.xml" <<'EOF'
+<PerfConfig>
+  <Resource name="cpu" someStallUs="200000" windowUs="2000000" coolDownSec="600" topCount="5"/>
+</PerfConfig>
+EOF
+fi
 "$BUILD/orvane-devsim" "$DEV" 2> "$SANDBOX/devsim.log" &
 DEVSIM_PID=$!
 if ! wait_for 10 test -e "$DEV/qxev"; then
@@ -209,6 +230,8 @@ run_demo() {
         "$BUILD/orvanectl" --workdir "$WORK" dump stats | tee "$SANDBOX/stats.txt" || true
     fi
 
+    run_perf_demo
+
     section "stopping the daemon and the emulator"
     stop_processes
     echo "stopped"
@@ -229,6 +252,11 @@ run_demo() {
     echo "905002001 as stored (serial sealed for the upload server):"
     sqlite3 "$DB" "select '  ' || param_list from event_info where event_id = 905002001;"
 
+    if [ "$PERF" = 1 ]; then
+        section "the performance event (909001001: CPU pressure, its figures and the busiest processes)"
+        sqlite3 "$DB" "select param_list from event_info where event_id = 909001001 limit 1;"
+    fi
+
     section "today's counters (event_daily)"
     sqlite3 -header -column "$DB" \
         "select event_id, daily_cnt, over_cnt, hour_cnt from event_daily order by event_id;"
@@ -241,6 +269,38 @@ run_demo() {
     [ -f "$SANDBOX/stats.txt" ] && awk '$1 ~ /^privacy\.dropped\./ && $2 > 0 {
         sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1}' "$SANDBOX/stats.txt"
     echo "$(grep -c "ParseEvent event invalid" "$LOG") records rejected by the source as invalid"
+}
+
+# CPU pressure from orvane-pressure until the kernel's trigger fires and the event is stored.
+run_perf_demo() {
+    section "performance event: CPU pressure"
+    if [ "$PERF" != 1 ]; then
+        echo "skipped: this kernel takes no pressure stall trigger here ($(echo "$PERF_PROBE" | head -n 1))"
+        return
+    fi
+    perf_watching() { "$BUILD/orvanectl" --workdir "$WORK" dump plugin PerfLogAnalyzer 2> /dev/null | grep -q "armed"; }
+    if ! wait_for 20 perf_watching; then
+        echo "PerfLogAnalyzer did not arm its trigger; the end of the daemon's log:"
+        tail -n 10 "$LOG"
+        return
+    fi
+    "$BUILD/orvane-pressure" cpu 40 > "$SANDBOX/pressure.log" 2>&1 &
+    PRESSURE_PID=$!
+    echo "orvane-pressure cpu: two spinning threads per CPU at the lowest priority, at most 40 s"
+    perf_stored() {
+        cp "$DB" "$SNAPSHOT" 2> /dev/null &&
+            [ "$(sqlite3 "$SNAPSHOT" "select count(*) from event_info where event_id = 909001001;" 2> /dev/null)" != 0 ]
+    }
+    if wait_for 40 perf_stored; then
+        echo "the trigger fired and event 909001001 was stored"
+    else
+        echo "no performance event within 40 s"
+    fi
+    kill "$PRESSURE_PID" 2> /dev/null || true
+    wait "$PRESSURE_PID" 2> /dev/null || true
+    PRESSURE_PID=
+    section "orvanectl dump plugin PerfLogAnalyzer"
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin PerfLogAnalyzer || true
 }
 
 # Load figures: end-to-end throughput with few and with many distinct ids, then the latency
