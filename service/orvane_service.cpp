@@ -103,7 +103,6 @@ void OrvaneService::NotifyUserActivated() {
 }
 
 void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
-    const auto deadline = std::chrono::steady_clock::now() + kDumpDeliveryBound;
     DaemonStats& stats = platform_->GetStats();
     // Sized to the cap, then sealed against growing: a write past the cap fails instead of
     // taking more memory, and the file offset tells how much was written.
@@ -122,6 +121,7 @@ void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
         stats.Add("service.dump.write_failures");
         return;
     }
+    const auto deadline = std::chrono::steady_clock::now() + kDumpDeliveryBound;
     bool delivered = CallerWriter::Write(fd, static_cast<const char*>(mapped), length, deadline);
     if (mapped != nullptr) {
         munmap(mapped, length);
