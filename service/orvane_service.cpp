@@ -4,6 +4,7 @@
 #include <sys/mman.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -25,6 +26,8 @@ namespace {
 using android::base::unique_fd;
 
 constexpr size_t kBinderThreads = 4;
+// The dump text goes to the caller in pieces of this size.
+constexpr size_t kDumpChunkBytes = 64 * 1024;
 constexpr uint32_t kControlEventType = 1;
 constexpr uint32_t kPackLogEventId = 101;
 constexpr uint32_t kUploadSwitchEventId = 103;
@@ -114,17 +117,14 @@ void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
         return;
     }
     WriteDump(text.get(), args);
-    off_t length = lseek(text.get(), 0, SEEK_CUR);
-    void* mapped = length > 0 ? mmap(nullptr, length, PROT_READ, MAP_SHARED, text.get(), 0) : nullptr;
-    if (mapped == MAP_FAILED) {
-        OLOGE_LIMITED("%s cannot map the dump's %lld bytes: %s", static_cast<long long>(length), strerror(errno));
-        stats.Add("service.dump.write_failures");
-        return;
-    }
+    const off_t length = lseek(text.get(), 0, SEEK_CUR);
     const auto deadline = std::chrono::steady_clock::now() + kDumpDeliveryBound;
-    bool delivered = CallerWriter::Write(fd, static_cast<const char*>(mapped), length, deadline);
-    if (mapped != nullptr) {
-        munmap(mapped, length);
+    bool delivered = true;
+    std::vector<char> chunk(std::min<size_t>(length, kDumpChunkBytes));
+    for (off_t done = 0; delivered && done < length;) {
+        ssize_t n = pread(text.get(), chunk.data(), std::min<off_t>(chunk.size(), length - done), done);
+        delivered = n > 0 && CallerWriter::Write(fd, chunk.data(), n, deadline);
+        done += n;
     }
     if (static_cast<size_t>(length) >= kMaxDumpBytes) {
         stats.Add("service.dump.cut");
