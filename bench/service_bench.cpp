@@ -54,7 +54,7 @@ struct Fixture {
         }
         platform.ParseArgs(static_cast<int>(argv.size()), argv.data());
         platform.StartPlatform();
-        server = new HostBinderServer();
+        server = new HostBinderServer(platform.GetStats());
         server->AddService(SocketPath(), new OrvaneNativeService(new OrvaneService(&platform), false));
         server->StartThreadPool(4);
     }
