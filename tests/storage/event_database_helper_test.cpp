@@ -1,7 +1,6 @@
 #include "storage/event_database_helper.h"
 
 #include <sched.h>
-#include <sqlite3.h>
 #include <sys/mount.h>
 #include <sys/statvfs.h>
 #include <sys/wait.h>
@@ -9,10 +8,8 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <future>
 #include <random>
 #include <sstream>
-#include <thread>
 
 #include <android-base/unique_fd.h>
 #include <gtest/gtest.h>
@@ -203,27 +200,6 @@ TEST_F(EventDatabaseHelperTest, FutureHappenTimeIsTakenAsNowAndAFutureDayStartHe
     EXPECT_EQ(Store(kIdQuota2, today + 8000), "over daily quota");
     EXPECT_EQ(Store(kIdQuota2, today + kDay), "");
     EXPECT_EQ(helper_->GetDbStartTime(), today + kDay);
-}
-
-TEST_F(EventDatabaseHelperTest, ReaderHoldingATransactionCostsNoEvent) {
-    Store(kIdMany, start_ + 10, "first");
-    std::promise<void> locked;
-    std::thread reader([&] {
-        sqlite3* db = nullptr;
-        sqlite3_open(path_.c_str(), &db);
-        sqlite3_exec(db, "BEGIN; select count(*) from event_info;", nullptr, nullptr, nullptr);
-        locked.set_value();
-        // A backup or a shell session holds its read transaction this long.
-        std::this_thread::sleep_for(std::chrono::milliseconds(1500));
-        sqlite3_exec(db, "COMMIT", nullptr, nullptr, nullptr);
-        sqlite3_close(db);
-    });
-    locked.get_future().wait();
-    for (int i = 0; i < 3; i++)
-        EXPECT_EQ(Store(kIdMany, start_ + 20 + i, "during " + kS(i)), "");
-    reader.join();
-    EXPECT_EQ(Column(path_, "select count(*) from event_info where param_list like 'during %'"), Texts{"3"});
-    EXPECT_EQ(Stat("storage.events.store_failed"), 0u);
 }
 
 // Trimming under a cap below one day's data: the oldest rows by time go, whatever their ids, until the

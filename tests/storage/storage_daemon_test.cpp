@@ -1,5 +1,4 @@
-// The daemon as a process, fed through emulated device nodes, against what a hostile world does to
-// its store: absurd happen times in kernel records, and other processes reading event.db.
+// The daemon as a process, fed through emulated device nodes, while another process reads its store.
 #include <signal.h>
 #include <spawn.h>
 #include <sqlite3.h>
@@ -60,7 +59,6 @@ protected:
                 },
                 std::chrono::seconds(30));
     }
-    std::string DayStart() { return Column(db_, "select start_time from db_version")[0]; }
     std::string Log() { return ReadFile(root_.File("orvane.log")); }
 
     DevSim devsim_;
@@ -68,24 +66,6 @@ protected:
     std::string db_ = root_.File("work/event.db");
     pid_t daemon_ = -1;
 };
-
-// One record from the year 2286 must not end the counting of days, not even after a restart.
-TEST_F(StorageDaemonTest, AbsurdHappenTimeLeavesTheDayAsItIs) {
-    uint64_t now = TimeUtil::GetTimestampSecond();
-    std::string today = std::to_string(TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(now)));
-    StartDaemon();
-    Record(903000001, now, "{}");
-    Record(903999999, 9999999999, "{}");
-    ASSERT_TRUE(WaitStored("event_id in (903000001, 903999999)", 2)) << Log();
-    EXPECT_EQ(DayStart(), today);
-    EXPECT_EQ(Column(db_, "select first_time < 9999999999 from event_info where event_id = 903999999"), Texts{"1"});
-    StopDaemon();
-
-    StartDaemon();
-    Record(903000002, now, "{}");
-    ASSERT_TRUE(WaitStored("event_id = 903000002", 1)) << Log();
-    EXPECT_EQ(DayStart(), today);
-}
 
 // Another process reading event.db for a while (a shell, a backup) delays the daemon's writes but
 // costs no event.
