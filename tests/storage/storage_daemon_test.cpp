@@ -84,7 +84,7 @@ TEST_F(StorageDaemonTest, ReaderHoldingATransactionCostsNoEvent) {
     std::this_thread::sleep_for(std::chrono::seconds(2));
     sqlite3_exec(reader, "COMMIT", nullptr, nullptr, nullptr);
     sqlite3_close(reader);
-    EXPECT_TRUE(WaitStored("param_list like '{\"during\":%'", 20)) << Log();
+    EXPECT_TRUE(WaitStored("event_id between 903001000 and 903001019", 20)) << Log();
 }
 
 }  // namespace
