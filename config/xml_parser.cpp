@@ -2,7 +2,6 @@
 
 #include <cstdio>
 #include <cstring>
-#include <mutex>
 
 #include <libxml/parser.h>
 
@@ -13,21 +12,21 @@
 namespace android {
 namespace Orvane {
 
+Mutex gXmlDocumentMutex;
+
 namespace {
 
 constexpr size_t kBlockSize = 4096;
 constexpr size_t kFirstBytes = 4;
 
-// Serialises all document reading: libxml2 is initialised and cleaned up around every document,
-// which must not overlap with another reader.
-std::mutex gDocumentMutex;
-
 const char* OrEmpty(const xmlChar* text) {
     return text != nullptr ? reinterpret_cast<const char*>(text) : "";
 }
 
+// libxml2's element callbacks, called from xmlParseChunk while a reader holds the document lock.
 void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI, int nb_namespaces,
-                      const xmlChar** namespaces, int nb_attributes, int nb_defaulted, const xmlChar** attributes) {
+                      const xmlChar** namespaces, int nb_attributes, int nb_defaulted, const xmlChar** attributes)
+        REQUIRES(gXmlDocumentMutex) {
     XmlParser* parser = static_cast<XmlParser*>(ctx);
     if (parser == nullptr) {
         OLOGD("%s local=%s parser is null. pre=%s,uri=%s,nb=%d,ns=%p,nb_de=%d", OrEmpty(localname), OrEmpty(prefix),
@@ -52,7 +51,8 @@ void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix
     parser->OnStartElement(name, attrs);
 }
 
-void OnEndElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI) {
+void OnEndElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI)
+        REQUIRES(gXmlDocumentMutex) {
     XmlParser* parser = static_cast<XmlParser*>(ctx);
     if (parser == nullptr) {
         OLOGI("%s parser is null. pre=%s,uri=%s", OrEmpty(prefix), OrEmpty(URI));
@@ -116,14 +116,14 @@ std::string XmlParser::GetAttribute(const std::map<std::string, std::string>& at
 }
 
 int32_t XmlParser::ParserXmlFile(const std::string& path, bool elementMode) {
-    std::lock_guard<std::mutex> lock(gDocumentMutex);
+    Mutex::Autolock lock(gXmlDocumentMutex);
     ClearFlags();
     sp<XmlParser> self(this);
     return elementMode ? ReadXmlFile(path, self) : ReadXmlFileWithBuf(path, self);
 }
 
 int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::string& entryName) {
-    std::lock_guard<std::mutex> lock(gDocumentMutex);
+    Mutex::Autolock lock(gXmlDocumentMutex);
     ZipReader reader;
     if (!reader.Open(zipPath)) {
         return -1;
@@ -140,17 +140,18 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     }
     bool entrySeen = false;
     bool failed = false;
-    auto consumer = [&](const char* data, uint32_t, int32_t length) -> int {
+    // Runs inside ExtractFile, below, with the document lock held.
+    auto consumer = [&](const char* data, uint32_t, int32_t length) REQUIRES(gXmlDocumentMutex) -> int {
         if (length < 0) {
             failed = true;
             return -1;
         }
         entrySeen = true;
         if (xmlParseChunk(ctxt, data, length, length == 0 ? 1 : 0) != 0 && !failed) {
-            // Logged once: a broken document would otherwise repeat the line for every block.
+            // Once per document (not per block), and collapsed when documents are read per lookup.
             xmlParserError(ctxt, "xmlParseChunk");
-            OLOG_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s",
-                    std::string(data, length).c_str());
+            OLOG_LIMITED_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s",
+                            std::string(data, length).c_str());
             failed = true;
         }
         return IsFinish() ? 1 : 0;
@@ -161,7 +162,7 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     xmlCleanupParser();
     reader.Close();
     if (extracted && !entrySeen) {
-        OLOGE("%s no entry %s in %s", entryName.c_str(), zipPath.c_str());
+        OLOGE_LIMITED("%s no entry %s in %s", entryName.c_str(), zipPath.c_str());
         return -1;
     }
     return (extracted && !failed) ? 0 : -1;
@@ -171,14 +172,14 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
     ScopedTrace trace(TraceName("ReadXmlFile ", path));
     FILE* file = fopen(path.c_str(), "rb");
     if (file == nullptr) {
-        OLOGE("%s not open file %s", path.c_str());
+        OLOGE_LIMITED("%s not open file %s", path.c_str());
         return -1;
     }
     FileCloser closer(file);
     char chunk[kBlockSize];
     size_t n = fread(chunk, 1, kFirstBytes, file);
     if (n == 0) {
-        OLOGE("%s file formate err, %s:", path.c_str());
+        OLOGE_LIMITED("%s file formate err, %s:", path.c_str());
         return -1;
     }
     xmlSAXHandler handler;
@@ -197,7 +198,7 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
         bool last = n == 0;
         if (xmlParseChunk(ctxt, chunk, static_cast<int>(n), last ? 1 : 0) != 0) {
             xmlParserError(ctxt, "xmlParseChunk");
-            OLOGE("%s xml parse chunk failed: %s", std::string(chunk, n).c_str());
+            OLOGE_LIMITED("%s xml parse chunk failed: %s", std::string(chunk, n).c_str());
             result = -1;
             break;
         }
@@ -214,7 +215,7 @@ int32_t ReadXmlFileWithBuf(const std::string& path, const sp<XmlParser>& parser)
     ScopedTrace trace(TraceName("ReadXmlFileWithBuf ", path));
     FILE* file = fopen(path.c_str(), "rb");
     if (file == nullptr) {
-        OLOGE("%s not open file %s", path.c_str());
+        OLOGE_LIMITED("%s not open file %s", path.c_str());
         return -1;
     }
     FileCloser closer(file);

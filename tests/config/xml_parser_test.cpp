@@ -1,8 +1,8 @@
 #include "config/xml_parser.h"
 
-#include <filesystem>
 #include <fstream>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -15,7 +15,9 @@ namespace {
 class RecordingParser : public XmlParser {
 public:
     RecordingParser() : XmlParser("doc.xml") {}
-    bool IsMatch(const std::string& name) override { return name == "root" && (SetStart(), true); }
+    bool IsMatch(const std::string& name) REQUIRES(gXmlDocumentMutex) override {
+        return name == "root" && (SetStart(), true);
+    }
     void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override {
         starts.push_back(name);
         for (const auto& [key, value] : attributes)
@@ -27,7 +29,6 @@ public:
 
 class XmlParserTest : public ::testing::Test {
 protected:
-    void TearDown() override { std::filesystem::remove_all(dir_); }
     std::string Write(const std::string& name, const std::string& content) {
         std::ofstream(dir_ + "/" + name, std::ios::binary | std::ios::trunc) << content;
         return dir_ + "/" + name;
@@ -47,7 +48,8 @@ protected:
             doc += "  <item i=\"" + std::to_string(i) + "\" pad=\"...........................\"/>\n";
         return doc + "</root>\n";
     }
-    std::string dir_ = mkdtemp(std::string("/tmp/xml_parser_test.XXXXXX").data());
+    TemporaryDir temp_;
+    std::string dir_ = temp_.path;
 };
 
 TEST_F(XmlParserTest, ElementModeStartsAtTheRootInFilesAndArchives) {
