@@ -10,6 +10,9 @@ namespace {
 
 constexpr uint32_t kIdsPerDomain = 1000000;
 constexpr uint32_t kFallbackLogCntLimit = 10;
+// Counts kept for ranges that the document in force leaves out; beyond this many (far more than
+// a document has ranges) they are let go, so that a stream of documents cannot grow the memory.
+constexpr size_t kMaxKeptLogCounters = 4096;
 
 // The attribute's value when it is a number of 1 or more; otherwise the default.
 void InitValue(const std::map<std::string, std::string>& attributes, const std::string& key, uint32_t& field,
@@ -86,6 +89,9 @@ int32_t EventQuotaXmlParser::LoadLocked(const DocumentFolders& folders, const st
         if (kept != keptLogCnt_.end()) {
             *count = kept->second;
         }
+    }
+    if (keptLogCnt_.size() > kMaxKeptLogCounters) {
+        keptLogCnt_.clear();  // the counts of this document's ranges live on in its records
     }
     return loadResult_;
 }

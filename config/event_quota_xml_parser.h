@@ -25,7 +25,7 @@ namespace Orvane {
 // The log counters live in memory only and outlive a reload: each belongs to its range (domain or
 // sub-domain, bounds, and its place among records of the same bounds), and a reloaded document's
 // record of the same range goes on from it. A range that a new document leaves out keeps its
-// count until a later document brings the range back.
+// count until a later document brings the range back (up to 4096 such counts).
 //
 // Concurrency: every public operation may be called from any thread; all of them take this
 // parser's mutex (loading included, before the document lock).

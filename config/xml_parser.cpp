@@ -80,6 +80,16 @@ xmlParserCtxtPtr CreatePushParser(xmlSAXHandler& handler, XmlParser* parser, con
     return ctxt;
 }
 
+// Frees the context with the document libxml2 builds on its own to keep a DOCTYPE's entity
+// declarations (for expat compatibility); nothing here uses them, and the context leaves it behind.
+void FreePushParser(xmlParserCtxtPtr ctxt) {
+    if (ctxt->myDoc != nullptr) {
+        xmlFreeDoc(ctxt->myDoc);
+        ctxt->myDoc = nullptr;
+    }
+    xmlFreeParserCtxt(ctxt);
+}
+
 // The trace section's name, built only while tracing is on.
 std::string TraceName(const char* op, const std::string& path) {
     return ScopedTrace::IsTraceEnabled() ? op + path : std::string();
@@ -158,7 +168,7 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     };
     char buffer[kBlockSize];
     bool extracted = reader.ExtractFile(entryName, buffer, sizeof(buffer), consumer);
-    xmlFreeParserCtxt(ctxt);
+    FreePushParser(ctxt);
     xmlCleanupParser();
     reader.Close();
     if (extracted && !entrySeen) {
@@ -172,14 +182,14 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
     ScopedTrace trace(TraceName("ReadXmlFile ", path));
     FILE* file = fopen(path.c_str(), "rb");
     if (file == nullptr) {
-        OLOGE_LIMITED("%s not open file %s", path.c_str());
+        OLOGE("%s not open file %s", path.c_str());
         return -1;
     }
     FileCloser closer(file);
     char chunk[kBlockSize];
     size_t n = fread(chunk, 1, kFirstBytes, file);
     if (n == 0) {
-        OLOGE_LIMITED("%s file formate err, %s:", path.c_str());
+        OLOGE("%s file formate err, %s:", path.c_str());
         return -1;
     }
     xmlSAXHandler handler;
@@ -198,7 +208,7 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
         bool last = n == 0;
         if (xmlParseChunk(ctxt, chunk, static_cast<int>(n), last ? 1 : 0) != 0) {
             xmlParserError(ctxt, "xmlParseChunk");
-            OLOGE_LIMITED("%s xml parse chunk failed: %s", std::string(chunk, n).c_str());
+            OLOGE("%s xml parse chunk failed: %s", std::string(chunk, n).c_str());
             result = -1;
             break;
         }
@@ -206,7 +216,7 @@ int32_t ReadXmlFile(const std::string& path, const sp<XmlParser>& parser) {
             break;
         }
     }
-    xmlFreeParserCtxt(ctxt);
+    FreePushParser(ctxt);
     xmlCleanupParser();
     return result;
 }
@@ -215,6 +225,7 @@ int32_t ReadXmlFileWithBuf(const std::string& path, const sp<XmlParser>& parser)
     ScopedTrace trace(TraceName("ReadXmlFileWithBuf ", path));
     FILE* file = fopen(path.c_str(), "rb");
     if (file == nullptr) {
+        // Text mode serves lookups made per event: a missing catalogue would repeat this for each.
         OLOGE_LIMITED("%s not open file %s", path.c_str());
         return -1;
     }
