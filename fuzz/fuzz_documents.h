@@ -19,7 +19,12 @@ namespace android {
 namespace Orvane {
 namespace FuzzDocuments {
 
+// liblog's logger hook takes one message record on a device, the record and the text on the host.
+#if defined(__ANDROID__)
+inline void DropLogLine(const struct __android_log_message*) {}
+#else
 inline void DropLogLine(const struct __android_logger_data*, const char*) {}
+#endif
 inline void DropXmlError(void*, const char*, ...) {}
 
 // Every log line is still formatted, so that its arguments are checked, but written nowhere;
