@@ -77,12 +77,12 @@ bool ConfigDocument::IsWellFormed(const std::string& path, const FileStamp& stam
 }
 
 DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std::string& fileName) {
-    const std::string& cloudDir = folders.cloudDir;
     const std::string& configDir = folders.configDir;
-    DocumentChoice cloud{cloudDir, cloudDir + fileName, FileUtil::GetFileStamp(cloudDir + fileName), true};
-    if (cloud.stamp.size >= 0 && cloudDir != configDir) {
+    if (folders.cloudDir != configDir) {
+        DocumentChoice cloud{folders.cloudDir, folders.cloudDir + fileName, {}, true};
+        cloud.stamp = FileUtil::GetFileStamp(cloud.path);
         bool fresh = false;
-        if (CheckWellFormed(cloud.path, cloud.stamp, fresh)) {
+        if (cloud.stamp.size >= 0 && CheckWellFormed(cloud.path, cloud.stamp, fresh)) {
             return cloud;
         }
         if (fresh) {  // once per version of the broken copy
@@ -91,7 +91,9 @@ DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std:
             folders.Count("cloud_rejected", fileName);
         }
     }
-    return {configDir, configDir + fileName, FileUtil::GetFileStamp(configDir + fileName), false};
+    DocumentChoice system{configDir, configDir + fileName, {}, false};
+    system.stamp = FileUtil::GetFileStamp(system.path);
+    return system;
 }
 
 }  // namespace Orvane
