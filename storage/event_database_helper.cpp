@@ -159,7 +159,7 @@ EventDatabaseHelper::DomainQuota EventDatabaseHelper::GetQuota(uint32_t eventId)
     if (context_ == nullptr) {
         return DomainQuota();
     }
-    return EventQuotaXmlParser::getInstance()->GetEventQuota(context_->GetConfigDir(), osVersion_, eventId);
+    return EventQuotaXmlParser::getInstance()->GetEventQuota(*context_, osVersion_, eventId);
 }
 
 void EventDatabaseHelper::ProcessFaultEvent(sp<Event> event) {
@@ -344,8 +344,7 @@ uint64_t EventDatabaseHelper::CheckAndGetLogTime(sp<Event> event, const DomainQu
         event->SetValue(kKeyNoCatchLog, kNoLogConfig);
         return lastLogTime;
     }
-    sp<EventInfoConfig> info =
-            EventXmlParser::getInstance()->GetEventInfoConfig(context_->GetConfigDir(), event->eventId);
+    sp<EventInfoConfig> info = EventXmlParser::getInstance()->GetEventInfoConfig(*context_, event->eventId);
     int32_t spacing = info != nullptr ? info->extendS : 0;
     uint64_t now = event->happenTime;
     bool tooSoon = spacing > 0 && now < lastLogTime + static_cast<uint64_t>(spacing);
@@ -518,7 +517,7 @@ void EventDatabaseHelper::DumpQuota(int fd, const std::string& eventId) {
     DomainQuota quota = GetQuota(id);
     // The range comes with the log counting lookup; an increment of 0 counts nothing.
     DomainQuota range;
-    EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(context_->GetConfigDir(), osVersion_, id, 0, &range);
+    EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, 0, &range);
     dprintf(fd,
             "EventId %u quota :\n    dailyCnt = %u\n    logCnt = %u    realLog = %u    logSpace = %u    sameLog = %u   "
             " "
