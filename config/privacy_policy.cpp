@@ -296,9 +296,9 @@ std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::ReadPolicy(const std::
     return policy;
 }
 
-std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const std::string& cloudDir,
-                                                                    const std::string& configDir, DaemonStats* stats) {
-    DocumentChoice choice = ConfigDocument::Choose(cloudDir, configDir, kFileName, stats);
+std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const DocumentFolders& folders) {
+    DocumentChoice choice = ConfigDocument::Choose(folders, kFileName);
+    DaemonStats* stats = folders.stats;
     Mutex::Autolock lock(mutex_);
     if (tried_ && choice.path == loadedPath_ && choice.stamp == loadedStamp_) {
         return current_ != nullptr ? current_ : PrivacyPolicy::Safest();
@@ -323,10 +323,6 @@ std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const std::s
         }
     }
     return current_ != nullptr ? current_ : PrivacyPolicy::Safest();
-}
-
-std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(PluginContext& context) {
-    return GetPolicy(context.GetCloudConfigDir(), context.GetConfigDir(), &context.GetStats());
 }
 
 }  // namespace Orvane
