@@ -8,7 +8,7 @@ packages=(
     libsqlite3-dev sqlite3 libxml2-dev libjsoncpp-dev libminizip-dev zlib1g-dev
     android-libutils-dev android-liblog-dev android-libcutils-dev android-libbase-dev
     android-platform-frameworks-native-headers
-    zip unzip libfuse3-dev fuse3 clang libclang-rt-14-dev
+    zip unzip libfuse3-dev fuse3 clang libclang-rt-14-dev python3
 )
 
 missing=()

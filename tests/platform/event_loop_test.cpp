@@ -105,6 +105,37 @@ TEST_F(EventLoopTest, WaitResultBlocksUntilRunAndFailsOnlyOnMinusOne) {
     EXPECT_EQ(loop_->AddEvent(handler, nullptr), UINT64_MAX);
 }
 
+// A caller waiting for an entry that only its own thread could run, or that a stopped loop never
+// runs, would wait for good: both are refused at once with one error line.
+TEST_F(EventLoopTest, WaitResultRefusedOnItsOwnLoopAndOnAStoppedLoop) {
+    LogCapture capture;
+    std::atomic<int> runs{0};
+    sp<EventHandler> handler = new CallbackHandler([&runs](sp<Event>&) { return ++runs; });
+    sp<Event> event = new Event("test");
+    // 0 while waiting, then 1 for false and 2 for true. The task holds the loop, so a loop stuck
+    // waiting for itself is left behind instead of hanging the test's teardown.
+    auto result = std::make_shared<std::atomic<int>>(0);
+    loop_->AddTask([loop = loop_, handler, event, result] { *result = loop->AddEventWaitResult(handler, event) + 1; });
+    ASSERT_TRUE(WaitUntil([&] { return *result != 0; })) << "a wait on the loop's own thread hangs";
+    EXPECT_EQ(*result, 1);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "AddEventWaitResult"), 1u) << capture.Dump();
+    // From another thread the same call runs the handler.
+    EXPECT_TRUE(loop_->AddEventWaitResult(handler, event));
+    EXPECT_EQ(runs, 1);
+
+    loop_->StopLoop();
+    capture.Clear();
+    *result = 0;
+    std::thread waiter(
+            [loop = loop_, handler, event, result] { *result = loop->AddEventWaitResult(handler, event) + 1; });
+    bool returned = WaitUntil([&] { return *result != 0; });
+    returned ? waiter.join() : waiter.detach();
+    ASSERT_TRUE(returned) << "a wait on a stopped loop hangs";
+    EXPECT_EQ(*result, 1);
+    EXPECT_EQ(runs, 1);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "AddEventWaitResult"), 1u) << capture.Dump();
+}
+
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
     std::string stat = "/proc/self/task/" + std::to_string(Drain()) + "/stat";
     std::atomic<int> ran{0};
