@@ -136,6 +136,34 @@ TEST_F(EventLoopTest, WaitResultRefusedOnItsOwnLoopAndOnAStoppedLoop) {
     EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "AddEventWaitResult"), 1u) << capture.Dump();
 }
 
+TEST_F(EventLoopTest, BacklogAndItsHighWaterMarkAndSlowEntriesAreReported) {
+    LogCapture capture;
+    auto stats = std::make_shared<DaemonStats>();
+    sp<EventLoop> loop = new EventLoop("stats_loop", stats);
+    loop->StartLoop();
+    Gate gate;
+    loop->AddTask([&gate] { gate.Wait(); });
+    ASSERT_TRUE(WaitUntil([&] { return loop->GetBacklog() == 0; }));  // taken: it holds the loop
+    for (int i = 0; i < 5; i++) {
+        loop->AddTask([] {});
+    }
+    loop->AddTask([] {}, 60);
+    EXPECT_EQ(loop->GetBacklog(), 6u);
+    gate.Open();
+    ASSERT_TRUE(WaitUntil([&] { return loop->GetBacklog() == 1; }));  // the one due in a minute
+    EXPECT_EQ(stats->Value("loop.stats_loop.backlog_high"), 6u);
+    // Only what runs 301 ms or more counts as slow, with the loop's line for it.
+    loop->AddTask([] { std::this_thread::sleep_for(milliseconds(320)); });
+    loop->AddTask([] { std::this_thread::sleep_for(milliseconds(5)); });
+    std::atomic<bool> done{false};
+    loop->AddTask([&done] { done = true; });
+    ASSERT_TRUE(WaitUntil([&] { return done.load(); }));
+    EXPECT_EQ(stats->Value("loop.stats_loop.slow"), 1u);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_DEBUG, "ProcessEventLoop onevent name stats_loop  consume time 3"), 1u)
+            << capture.Dump();
+    loop->StopLoop();
+}
+
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
     std::string stat = "/proc/self/task/" + std::to_string(Drain()) + "/stat";
     std::atomic<int> ran{0};

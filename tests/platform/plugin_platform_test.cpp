@@ -199,6 +199,11 @@ TEST_F(PluginPlatformTest, StartsPluginsSourcesAndDelayedPlugins) {
     EXPECT_GE(delayed.when - start, std::chrono::milliseconds(900));
     EXPECT_EQ(delayed.thread, ThreadOfLoop(platform->GetSharedWorkLoop()));
     EXPECT_EQ(platform->GetPlugins()["PlatTestDelayed"]->GetLooper()->GetName(), "late_loop");
+
+    // Every loop the platform made reports to its statistics.
+    for (const char* loop : {"plat_shared", "qx_unorder", "src_loop", "proc_loop"}) {
+        EXPECT_GE(platform->GetStats().Value(std::string("loop.") + loop + ".backlog_high"), 1u) << loop;
+    }
 }
 
 TEST_F(PluginPlatformTest, DelayedPluginsLoadOnceAndALooplessDelayedSourceLeavesTheWorkLoopFree) {
