@@ -87,7 +87,6 @@ PluginPlatform::~PluginPlatform() {
 }
 
 int PluginPlatform::ParseArgs(int argc, char** argv) {
-    startupThread_.Check(__func__);
     OLOGD("%s agc=%d", argc);
     for (int i = 1; i + 1 < argc; i += 2) {
         std::string option = argv[i];
@@ -131,7 +130,6 @@ std::string PluginPlatform::GetDevicePath(const std::string& name, const std::st
 }
 
 bool PluginPlatform::StartPlatform() {
-    startupThread_.Check(__func__);
     ForceCreateDirs();
     if (IsExist()) {
         return false;
@@ -235,7 +233,6 @@ std::string PluginPlatform::GetPluginConfigPath() {
 }
 
 void PluginPlatform::LoadPlugins(const Config& config) {
-    startupThread_.Check(__func__);
     // Sources started below wait for this until the last plugin is loaded.
     std::promise<void> loaded;
     sourcesMayStart_ = loaded.get_future().share();

@@ -19,7 +19,6 @@
 #include "platform/pipeline.h"
 #include "platform/plugin.h"
 #include "platform/plugin_context.h"
-#include "utils/thread_checker.h"
 
 namespace android {
 namespace Orvane {
@@ -28,12 +27,12 @@ namespace Orvane {
 // constructs and loads the plugins, builds the pipelines, starts the event sources and
 // announces that it is ready. It is the context of every plugin.
 //
-// Threads: ParseArgs and StartPlatform run on one thread (the main thread) before anything else
-// uses the platform, which `startupThread_` checks; the folders and options they set, the shared
-// work loop and the dispatcher are read-only afterwards, except the cloud configuration folder.
-// `mutex_` guards that folder and the plugin, pipeline and loop tables (delayed plugins are
-// added later on the shared work loop); callers get copies of the pointers and call plugins
-// outside the lock. Every loop that the platform creates reports to its statistics.
+// Threads: ParseArgs and StartPlatform run on the main thread before anything else uses the
+// platform; the folders and options they set, the shared work loop and the dispatcher are
+// read-only afterwards, except the cloud configuration folder. `mutex_` guards that folder and
+// the plugin, pipeline and loop tables (delayed plugins are added later on the shared work
+// loop); callers get copies of the pointers and call plugins outside the lock. Every loop that
+// the platform creates reports to its statistics.
 class PluginPlatform : public PluginContext {
 public:
     // The daemon's one platform, created on first use and never destroyed.
@@ -102,7 +101,6 @@ private:
     // True for the first caller only: a plugin is loaded once, by the start-up or by its delay.
     bool ClaimLoad(const std::string& name);
 
-    ThreadChecker startupThread_;
     std::atomic<bool> isReady_{false};
     // Shared with the loops, which may outlive the platform in a plugin's hands.
     const std::shared_ptr<DaemonStats> stats_ = std::make_shared<DaemonStats>();

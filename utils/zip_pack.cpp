@@ -1,11 +1,14 @@
 #include "utils/zip_pack.h"
 
+#include <fcntl.h>
+#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <cstring>
 #include <ctime>
+
+#include <android-base/unique_fd.h>
 
 #include "utils/file_util.h"
 #include "utils/orvane_log.h"
@@ -44,7 +47,7 @@ bool ZipBase::OpenNewFileInZip(zipFile zipHandle, const std::string& entryName) 
                                    Z_DEFAULT_COMPRESSION, 0, -MAX_WBITS, kMemLevel, Z_DEFAULT_STRATEGY, nullptr, 0, 0,
                                    kUtf8NameFlag);
     if (ret != ZIP_OK) {
-        OLOGE("%s zipOpenNewFileInZip4 failed");
+        OLOGE_LIMITED("%s zipOpenNewFileInZip4 failed");
         return false;
     }
     return true;
@@ -61,15 +64,17 @@ ZipPack::~ZipPack() {
 
 bool ZipPack::CreateZip(const std::string& path) {
     Close();
+    owner_.Check(__func__);
     zipHandle_ = OpenZip(path, APPEND_STATUS_CREATE);
     if (zipHandle_ == nullptr) {
-        OLOGE("%s Couldn't create ZIP file at path %s %p", path.c_str(), zipHandle_);
+        OLOGE_LIMITED("%s Couldn't create ZIP file at path %s %p", path.c_str(), zipHandle_);
         return false;
     }
     return true;
 }
 
 bool ZipPack::AddFiles(const std::vector<std::string>& paths) {
+    owner_.Check(__func__);
     if (zipHandle_ == nullptr) {
         return false;
     }
@@ -78,6 +83,7 @@ bool ZipPack::AddFiles(const std::vector<std::string>& paths) {
 }
 
 bool ZipPack::FlushFilesIfNeeded(bool force) {
+    owner_.Check(__func__);
     if (pending_.size() < kBatchSize && !force) {
         return true;
     }
@@ -122,42 +128,41 @@ bool ZipPack::AddFileContentToZip(const std::string& path) {
     if (!FileUtil::FileExists(path)) {
         return false;
     }
-    FILE* file = fopen(path.c_str(), "rb");
-    if (file == nullptr) {
-        OLOGI("%s open file %s failed", path.c_str());
+    android::base::unique_fd fd(TEMP_FAILURE_RETRY(open(path.c_str(), O_RDONLY | O_CLOEXEC)));
+    if (fd < 0) {
+        OLOGI_LIMITED("%s open file %s failed", path.c_str());
         return false;
     }
     char buffer[kCopyBufferSize];
-    bool ok = true;
-    while (!feof(file)) {
-        size_t n = fread(buffer, 1, sizeof(buffer), file);
-        if (n > 0 && zipWriteInFileInZip(zipHandle_, buffer, static_cast<unsigned>(n)) != ZIP_OK) {
-            OLOGI("%s Could not write data to zip for path:%s ", path.c_str());
-            ok = false;
-            break;
-        }
-        if (n < 1 && ferror(file)) {
-            // A read error never turns into end of file; keep what was copied so far.
-            OLOGI("%s read file %s failed", path.c_str());
-            ok = false;
-            break;
+    ssize_t n;
+    while ((n = TEMP_FAILURE_RETRY(read(fd, buffer, sizeof(buffer)))) > 0) {
+        if (zipWriteInFileInZip(zipHandle_, buffer, static_cast<unsigned>(n)) != ZIP_OK) {
+            OLOGI_LIMITED("%s Could not write data to zip for path:%s ", path.c_str());
+            return false;
         }
     }
-    fclose(file);
-    return ok;
+    if (n < 0) {
+        // Keeps what was copied so far.
+        OLOGI_LIMITED("%s read file %s failed", path.c_str());
+        return false;
+    }
+    return true;
 }
 
 void ZipPack::Close() {
+    owner_.Check(__func__);
     if (zipHandle_ == nullptr) {
+        owner_.Detach();
         return;
     }
     if (!FlushFilesIfNeeded(true)) {
-        OLOGE("%s force flush files failed");
+        OLOGE_LIMITED("%s force flush files failed");
     }
     if (zipClose(zipHandle_, nullptr) != ZIP_OK) {
-        OLOGE("%s close zip file failed");
+        OLOGE_LIMITED("%s close zip file failed");
     }
     zipHandle_ = nullptr;
+    owner_.Detach();
 }
 
 ZipReader::~ZipReader() {
@@ -165,18 +170,19 @@ ZipReader::~ZipReader() {
 }
 
 bool ZipReader::Open(const std::string& path) {
+    owner_.Check(__func__);
     if (unzHandle_ != nullptr) {
         OLOGD("%s unzip file already exist %s", path.c_str());
         return false;
     }
     unzHandle_ = OpenForUnzip(path);
     if (unzHandle_ == nullptr) {
-        OLOGI("%s unzip file failed %s", path.c_str());
+        OLOGI_LIMITED("%s unzip file failed %s", path.c_str());
         return false;
     }
     unz_global_info globalInfo = {};
     if (unzGetGlobalInfo(unzHandle_, &globalInfo) != UNZ_OK) {
-        OLOG_AS(ANDROID_LOG_INFO, "OpenInternal", "%s open unzip internal file get Global info failed");
+        OLOG_LIMITED_AS(ANDROID_LOG_INFO, "OpenInternal", "%s open unzip internal file get Global info failed");
         return false;
     }
     entryCount_ = static_cast<int32_t>(globalInfo.number_entry);
@@ -188,12 +194,13 @@ bool ZipReader::Open(const std::string& path) {
 }
 
 bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t bufferSize, const Consumer& consumer) {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
         return false;
     }
     if (!atFirstEntry_) {
         if (unzGoToFirstFile(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file goto first failed %s", entryName.c_str());
+            OLOGI_LIMITED("%s unzip file goto first failed %s", entryName.c_str());
             return false;
         }
         atFirstEntry_ = true;
@@ -205,7 +212,7 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
         char name[kNameBufferSize + 1] = {};  // one spare byte keeps a full-length name terminated
         unz_file_info info = {};
         if (unzGetCurrentFileInfo(unzHandle_, &info, name, kNameBufferSize, nullptr, 0, nullptr, 0) != UNZ_OK) {
-            OLOGI("%s get zip file info failed %s", entryName.c_str());
+            OLOGI_LIMITED("%s get zip file info failed %s", entryName.c_str());
             return false;
         }
         if (info.size_filename < kNameBufferSize && info.size_filename == entryName.size() &&
@@ -214,7 +221,7 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
         }
         if (i < entryCount_ - 1) {
             if (unzGoToNextFile(unzHandle_) != UNZ_OK) {
-                OLOGI("%s goto next file info failed %s", name);
+                OLOGI_LIMITED("%s goto next file info failed %s", name);
             }
             atFirstEntry_ = false;
         }
@@ -223,11 +230,12 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
 }
 
 bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consumer& consumer) {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
         return false;
     }
     if (unzOpenCurrentFile(unzHandle_) != UNZ_OK) {
-        OLOGI("%s open current unzip file info failed");
+        OLOGI_LIMITED("%s open current unzip file info failed");
         return false;
     }
     while (true) {
@@ -237,7 +245,7 @@ bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consume
             break;
         }
         if (n < 0) {
-            OLOGI("%s read unzip file info failed %d", n);
+            OLOGI_LIMITED("%s read unzip file info failed %d", n);
             break;
         }
         if (n == 0) {
@@ -245,28 +253,31 @@ bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consume
         }
     }
     if (unzCloseCurrentFile(unzHandle_) != UNZ_OK) {
-        OLOGI("%s close current unzip file failed");
+        OLOGI_LIMITED("%s close current unzip file failed");
         return false;
     }
     return true;
 }
 
 void ZipReader::Close() {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
+        owner_.Detach();
         return;
     }
     if (unzClose(unzHandle_) != UNZ_OK) {
         if (unzGoToFirstFile(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file goto first failed ");
+            OLOGI_LIMITED("%s unzip file goto first failed ");
             return;
         }
         if (unzClose(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file close failed");
+            OLOGI_LIMITED("%s unzip file close failed");
         }
     }
     unzHandle_ = nullptr;
     entryCount_ = 0;
     atFirstEntry_ = true;
+    owner_.Detach();
 }
 
 }  // namespace Orvane

@@ -6,6 +6,8 @@
 
 #include <fstream>
 
+#include <android-base/file.h>
+
 #include "platform/plugin_factory.h"
 #include "tests/platform/platform_test_util.h"
 #include "utils/file_util.h"
@@ -82,12 +84,8 @@ protected:
     // The properties this test sets live in this process only, never in a shared store.
     static void SetUpTestSuite() { unsetenv("ORVANE_PROPERTY_FILE"); }
     void SetUp() override {
-        char pattern[] = "/tmp/plugin_platform_test_XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern, etc_ = root_ + "/etc/", cloud_ = root_ + "/cloud/";
-        ASSERT_EQ(system(("mkdir -p " + etc_ + " " + cloud_).c_str()), 0);
+        ASSERT_TRUE(FileUtil::CreateDirectory(etc_, 0775) && FileUtil::CreateDirectory(cloud_, 0775));
     }
-    ~PluginPlatformTest() override { system(("rm -rf " + root_).c_str()); }
 
     static void Write(const std::string& path, const std::string& content) { std::ofstream(path) << content; }
     std::unique_ptr<PluginPlatform> NewPlatform(std::vector<std::string> args = {}) {
@@ -111,7 +109,8 @@ protected:
         return std::count(entries.begin(), entries.end(), what);
     }
 
-    std::string root_, etc_, cloud_;
+    TemporaryDir tmp_;
+    const std::string root_ = tmp_.path, etc_ = root_ + "/etc/", cloud_ = root_ + "/cloud/";
 };
 
 TEST_F(PluginPlatformTest, ParseArgsNormalisesFoldersAndRefusesUnknownOptions) {
