@@ -96,7 +96,7 @@ void Pipeline::RegisterPluginListener(sp<Plugin> listener) {
     if (listener == nullptr) {
         return;
     }
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     if (listeners_->count(listener) > 0) {
         return;
     }
@@ -106,7 +106,7 @@ void Pipeline::RegisterPluginListener(sp<Plugin> listener) {
 }
 
 void Pipeline::ReleaseListeners() {
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     listeners_ = std::make_shared<const ListenerSet>();
 }
 
@@ -115,7 +115,7 @@ std::set<sp<Plugin>> Pipeline::GetListeners() const {
 }
 
 std::shared_ptr<const Pipeline::ListenerSet> Pipeline::CurrentListeners() const {
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     return listeners_;
 }
 

@@ -2,11 +2,11 @@
 #define ORVANE_PLATFORM_PIPELINE_H
 
 #include <memory>
-#include <mutex>
 #include <set>
 #include <string>
 #include <vector>
 
+#include <utils/Mutex.h>
 #include <utils/RefBase.h>
 #include <utils/StrongPointer.h>
 
@@ -49,8 +49,8 @@ private:
 
     const std::string name_;
     const std::vector<sp<Plugin>> plugins_;
-    mutable std::mutex listenersLock_;
-    std::shared_ptr<const ListenerSet> listeners_;
+    mutable Mutex listenersLock_;
+    std::shared_ptr<const ListenerSet> listeners_ GUARDED_BY(listenersLock_);
 };
 
 }  // namespace Orvane
