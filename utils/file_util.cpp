@@ -152,8 +152,9 @@ bool LoadStringFromFile(const std::string& path, std::string& content) {
         OLOGE_LIMITED("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
         return false;
     }
-    off_t size = lseek(fd, 0, SEEK_END);
-    if (size < 0 || size > kMaxLoadBytes || lseek(fd, 0, SEEK_SET) != 0) {
+    // Measured with fstat: files of /proc (seq files) refuse a seek to their end.
+    struct stat st;
+    if (fstat(fd, &st) != 0 || st.st_size > kMaxLoadBytes) {
         OLOGE_LIMITED("%s %s is over %lld bytes or cannot be measured", path.c_str(),
                       static_cast<long long>(kMaxLoadBytes));
         return false;

@@ -63,8 +63,9 @@ TEST_F(FileUtilTest, LoadLimitNulTrimmingAndSaveModes) {
     EXPECT_TRUE(content.size() == size_t{kLimit} && content.front() == 'A' && content.back() == 'Z') << content.size();
     ASSERT_EQ(ftruncate(fd, kLimit + 1), 0);
     EXPECT_EQ("<failed>", Load(big));  // refused, content untouched
-    // Files of /proc measure 0 bytes, yet have content.
+    // Files of /proc measure 0 bytes, yet have content; most of them cannot even seek to their end.
     EXPECT_NE(std::string::npos, Load("/proc/self/cmdline").find("file_util_test"));
+    EXPECT_EQ(0u, Load("/proc/self/status").find("Name:"));
 
     const std::string file = Path("save");
     ASSERT_TRUE(SaveStringToFile(file, std::string("\0\0one\0", 6), true) &&
