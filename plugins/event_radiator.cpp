@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <cstdint>
-#include <optional>
 #include <string_view>
 
 #include "platform/pipeline.h"
@@ -53,12 +52,6 @@ unique_fd OpenNode(const std::string& path, bool report) {
     }
     return fd;
 }
-
-struct ScannedRecord {
-    uint64_t id = 0;
-    uint64_t happenTime = 0;
-    std::string_view firstToken;
-};
 
 struct Number {
     bool negative = false;
