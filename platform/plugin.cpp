@@ -48,12 +48,21 @@ bool EventSource::PublishPipelineEvent(sp<Event> event) {
         return false;
     }
     for (const auto& pipeline : pipelines_) {
-        if (pipeline != nullptr && pipeline->CanProcessEvent(event)) {
+        if (pipeline->CanProcessEvent(event)) {
             pipeline->ProcessPipeline(event, 0);
             return true;
         }
+        pipeline->CountRefused();
     }
     return false;
+}
+
+uint64_t EventSource::Backlog() const {
+    uint64_t backlog = 0;
+    for (const auto& pipeline : pipelines_) {
+        backlog += pipeline->Backlog();
+    }
+    return backlog;
 }
 
 void EventListener::AddListenerInfo(uint32_t eventType, uint32_t beginId, uint32_t endId) {

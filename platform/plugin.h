@@ -84,6 +84,8 @@ public:
     void AddPipeline(const std::string& name, sp<Pipeline> pipeline);
     // False for an empty event or when no pipeline accepts it.
     bool PublishPipelineEvent(sp<Event> event);
+    // Events in this source's pipelines that have not come through yet (Pipeline::Backlog).
+    uint64_t Backlog() const;
 
 private:
     std::vector<sp<Pipeline>> pipelines_;
