@@ -206,11 +206,10 @@ run_demo() {
     # The daemon's writes take no busy time-out, so nothing reads its database while it runs:
     # progress is read from copies, the results after it has stopped.
     SNAPSHOT=$SANDBOX/snapshot.db
-    privacy_drops() { # events the privacy policy dropped, from the daemon's statistics
+    drops() { # events the privacy policy or the quotas dropped, from the daemon's statistics
         "$BUILD/orvanectl" --workdir "$WORK" dump stats 2> /dev/null |
-            awk '$1 ~ /^privacy\.dropped\./ {n += $2} END {print n + 0}'
+            awk '$1 ~ /^(privacy|storage\.events)\.dropped\./ {n += $2} END {print n + 0}'
     }
-    drops() { echo $(($(grep -c "over daily cnt drop it\|over hour cnt drop it" "$LOG" || true) + $(privacy_drops))); }
     stored() { # kept fault occurrences of the domains written above
         cp "$DB" "$SNAPSHOT" 2> /dev/null &&
             sqlite3 "$SNAPSHOT" "select coalesce(sum(occured_cnt), 0) from event_info
@@ -264,14 +263,16 @@ run_demo() {
     sqlite3 -header -column "$DB" \
         "select event_id, daily_cnt, over_cnt, hour_cnt from event_daily order by event_id;"
 
-    section "drops and their reasons (from the daemon's log)"
-    {
-        grep -o "event [0-9]* over daily cnt" "$LOG" | awk '{print $2, "over daily quota"}'
-        grep -o "event [0-9]* over hour cnt" "$LOG" | awk '{print $2, "event happen too sequence, drop it by punish"}'
-    } | sort | uniq -c | awk '{c=$1; $1=""; printf "%6d x%s\n", c, $0}'
-    [ -f "$SANDBOX/stats.txt" ] && awk '$1 ~ /^privacy\.dropped\./ && $2 > 0 {
-        sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1}' "$SANDBOX/stats.txt"
-    echo "$(grep -c "ParseEvent event invalid" "$LOG") records rejected by the source as invalid"
+    section "drops and their reasons (from the daemon's statistics)"
+    sqlite3 "$DB" "select '  ' || event_id || ': ' || over_cnt || ' dropped over its daily quota or by the hourly pacing'
+                   from event_daily where over_cnt > 0 order by event_id;"
+    [ -f "$SANDBOX/stats.txt" ] && awk '
+        $1 == "storage.events.dropped.over_daily_quota" { printf "%6d x over daily quota\n", $2 }
+        $1 == "storage.events.dropped.punished" { printf "%6d x event happen too sequence, drop it by punish\n", $2 }
+        $1 ~ /^privacy\.dropped\./ && $2 > 0 {
+            sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1 }
+        $1 ~ /^source\.EventRadiator\.rejected\./ { rejected += $2 }
+        END { printf "%6d records rejected by the source as invalid\n", rejected }' "$SANDBOX/stats.txt"
 }
 
 # CPU pressure from orvane-pressure until the kernel's trigger fires and the event is stored.

@@ -253,7 +253,7 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         event->SetValue(kKeyDropReason, "over daily quota");
         overCnt++;
         ReportEventOverQuota(event, dailyCnt, maxCnt);
-        OLOGI("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt), maxCnt);
+        OLOGI_LIMITED("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt), maxCnt);
         droppedOverQuota_->fetch_add(1, std::memory_order_relaxed);
         dropped = true;
     } else {
@@ -269,7 +269,7 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
             if (newHour > halfCnt &&
                 now - lastHappen < (dbStartTime_ + kDaySeconds - now) * (newHour - halfCnt) / remaining) {
                 event->SetValue(kKeyDropReason, "event happen too sequence, drop it by punish");
-                OLOGI("%s event %d over hour cnt drop it, hourCnt=%d halfCnt=%d, maxCnt=%u", eventId,
+                OLOGI_LIMITED("%s event %d over hour cnt drop it, hourCnt=%d halfCnt=%d, maxCnt=%u", eventId,
                       static_cast<int>(newHour), static_cast<int>(halfCnt), maxCnt);
                 dailyCnt--;  // the stored count stays as it was
                 overCnt++;

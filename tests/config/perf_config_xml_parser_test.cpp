@@ -10,6 +10,7 @@
 
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 
 namespace android::Orvane {
 namespace {
@@ -128,7 +129,7 @@ TEST(PerfConfigXmlParserTest, DocumentFollowsTheChosenCopyAndItsVersions) {
 TEST(PerfConfigXmlParserTest, ShippedSettingsArmWithoutPrivilege) {
     DaemonStats stats;
     std::vector<PerfResourceConfig> resources;
-    ASSERT_TRUE(PerfConfigXmlParser::Read(std::string(ORVANE_SOURCE_DIR) + "/etc/perf_config.xml", resources, &stats));
+    ASSERT_TRUE(PerfConfigXmlParser::Read(TestDataDir() + "/etc/perf_config.xml", resources, &stats));
     ASSERT_EQ(3u, resources.size());
     EXPECT_EQ(0u, stats.Value("config.perf_config.rejected"));
     for (const PerfResourceConfig& resource : resources) {

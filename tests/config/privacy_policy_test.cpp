@@ -8,6 +8,7 @@
 
 #include "tests/common/envelope_opener.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 
 namespace android::Orvane {
 namespace {
@@ -39,7 +40,7 @@ protected:
 // inside the allowed folders.
 TEST_F(PrivacyPolicyTest, ShippedPolicy) {
     std::string error;
-    std::string etc = std::string(ORVANE_SOURCE_DIR) + "/etc/";
+    std::string etc = TestDataDir() + "/etc/";
     auto policy = PrivacyPolicyParser::ReadPolicy(etc + "privacy_policy.xml", etc, error);
     ASSERT_NE(policy, nullptr) << error;
     EXPECT_EQ(policy->MaxLevel(true), 3u);

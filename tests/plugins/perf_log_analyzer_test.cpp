@@ -22,6 +22,7 @@
 #include "platform/plugin_factory.h"
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "utils/json_util.h"
 
 namespace android::Orvane {
@@ -209,7 +210,7 @@ TEST(PerfLogAnalyzerTest, RealTriggerBecomesFaultEventAndCoolsDown) {
         }
     }
     // Privacy and storage know the event by its catalogue entry: every value must be catalogued.
-    std::string etc = std::string(ORVANE_SOURCE_DIR) + "/etc/";
+    std::string etc = TestDataDir() + "/etc/";
     auto catalogued = [&etc](uint32_t id, const Json::Value& object) {
         sp<EventInfoConfig> entry = EventXmlParser::getInstance()->GetEventInfoConfig(etc, id);
         ASSERT_NE(nullptr, entry) << id;

@@ -11,6 +11,7 @@
 #include "storage/event_database.h"
 #include "tests/common/envelope_opener.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 #include "utils/time_util.h"
@@ -34,7 +35,7 @@ ORVANE_REGISTER_PLUGIN(PrivacyTestSource);
 
 TEST(PrivacyPlatformTest, OnlyWhatThePolicyAllowsIsStored) {
     TempDir root;
-    const std::string etc = std::string(ORVANE_SOURCE_DIR) + "/etc/";
+    const std::string etc = TestDataDir() + "/etc/";
     for (const char* name : {"event.xml", "event_quota.xml", "privacy_policy.xml", "privacy_server_key.pem"}) {
         WriteFile(root.File(name), ReadFile(etc + name));
     }
@@ -82,8 +83,7 @@ TEST(PrivacyPlatformTest, OnlyWhatThePolicyAllowsIsStored) {
     ASSERT_TRUE(Json::Reader().parse(rows[3].substr(10), sealed)) << rows[3];
     EXPECT_EQ(rows[3].rfind(R"(905002001 {"device":"ufs0","lifeUsed":0,"serial":")", 0), 0u) << rows[3];
     std::string serial;
-    EnvelopeOpener server(
-            ReadFile(std::string(ORVANE_SOURCE_DIR) + "/tests/common/privacy_test_server_private_key.pem"));
+    EnvelopeOpener server(ReadFile(TestDataDir() + "/tests/common/privacy_test_server_private_key.pem"));
     ASSERT_TRUE(server.Open(sealed["serial"].asString(), serial));
     EXPECT_EQ(serial, "UFS-0042");
     EXPECT_EQ(stats.Value("privacy.encrypted"), 1u);

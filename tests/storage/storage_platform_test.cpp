@@ -15,6 +15,7 @@
 #include "platform/plugin_platform.h"
 #include "storage/event_database.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 #include "utils/time_util.h"
@@ -41,7 +42,7 @@ ORVANE_REGISTER_PLUGIN(StorageTestSource);
 class StoragePlatformTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        std::string shipped = ReadFile(std::string(ORVANE_SOURCE_DIR) + "/etc/plugin_config");
+        std::string shipped = ReadFile(TestDataDir() + "/etc/plugin_config");
         const std::string source = "\nplugins:1\nStorageTestSource[thread:source_loop]:0 static\npipelinetriggers:1\n";
         WriteFile(root_.File("plugin_config"), shipped + source + "StorageTestSource: dftFaultEvent\n");
         const std::string os = DevInfo::GetQuorVersion(),
