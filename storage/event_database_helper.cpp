@@ -253,7 +253,8 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         event->SetValue(kKeyDropReason, "over daily quota");
         overCnt++;
         ReportEventOverQuota(event, dailyCnt, maxCnt);
-        OLOGI_LIMITED("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt), maxCnt);
+        OLOGI_LIMITED("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt),
+                      maxCnt);
         droppedOverQuota_->fetch_add(1, std::memory_order_relaxed);
         dropped = true;
     } else {
@@ -270,7 +271,7 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
                 now - lastHappen < (dbStartTime_ + kDaySeconds - now) * (newHour - halfCnt) / remaining) {
                 event->SetValue(kKeyDropReason, "event happen too sequence, drop it by punish");
                 OLOGI_LIMITED("%s event %d over hour cnt drop it, hourCnt=%d halfCnt=%d, maxCnt=%u", eventId,
-                      static_cast<int>(newHour), static_cast<int>(halfCnt), maxCnt);
+                              static_cast<int>(newHour), static_cast<int>(halfCnt), maxCnt);
                 dailyCnt--;  // the stored count stays as it was
                 overCnt++;
                 droppedPunished_->fetch_add(1, std::memory_order_relaxed);
