@@ -1,6 +1,9 @@
 #include "service/orvane_service.h"
 
+#include <string.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -10,6 +13,7 @@
 #include <vector>
 
 #include <android-base/file.h>
+#include <android-base/unique_fd.h>
 #include <gtest/gtest.h>
 #include <utils/Mutex.h>
 
@@ -198,7 +202,15 @@ TEST_F(OrvaneServiceTest, StartServiceServesWithCheckSwitchedOff) {
     static PluginPlatform* servedPlatform = platform_;  // outlives the test, like the thread
     platform_ = nullptr;
     std::thread([] { sp<OrvaneService>(new OrvaneService(servedPlatform))->StartService(); }).detach();
-    ASSERT_TRUE(WaitUntil([this] { return FileUtil::FileExists(SocketPath()); }));
+    // The socket's file appears at bind, before its mode is set and it listens: wait for a
+    // connection to go through.
+    ASSERT_TRUE(WaitUntil([this] {
+        struct sockaddr_un addr = {};
+        addr.sun_family = AF_UNIX;
+        strncpy(addr.sun_path, SocketPath().c_str(), sizeof(addr.sun_path) - 1);
+        android::base::unique_fd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        return connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) == 0;
+    }));
     EXPECT_EQ(std::filesystem::status(SocketPath()).permissions(), std::filesystem::perms(0660));
     Ctl({"user-activated"}, 0);  // root passes with the check off
     EXPECT_TRUE(WaitUntil([] { return EventsOf(105).size() == 1; }));
