@@ -195,7 +195,7 @@ unsigned long RunLogManager::NextDelaySeconds() {
     // The directory storage reads the quotas from: the parser keeps one document loaded, and
     // asking it for another would read it anew and reset storage's running log counts.
     EventQuotaXmlParser::SummaryQuota summary = EventQuotaXmlParser::getInstance()->GetSummaryQuota(
-            GetPluginContext()->GetConfigDir(), DevInfo::GetQuorVersion());
+            *GetPluginContext(), DevInfo::GetQuorVersion());
     period_ = summary.logStatic == 0 ? kDefaultPeriodMinutes : std::min(summary.logStatic, kMaxPeriodMinutes);
     {
         Mutex::Autolock lock(mutex_);
