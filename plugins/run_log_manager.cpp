@@ -67,7 +67,7 @@ void RunLogManager::OnLoad() {
         OLOGE("%s no plugin context, log filter statistics not reported");
         return;
     }
-    PostRun(period_, true);
+    PostRun(period_ / timing_.speedUp, true);
 }
 
 void RunLogManager::PostRun(unsigned long delaySeconds, bool periodic) {
@@ -139,7 +139,7 @@ bool RunLogManager::GetLogFilterDetail(Json::Value& report) {
     DaemonStats& stats = GetPluginContext()->GetStats();
     CommandPipe logcat;
     if (!logcat.Start({"logcat", "-S"})) {
-        OLOGW("%s open logcat failed");
+        OLOGW_LIMITED("%s open logcat failed");
         stats.Add("runlog.start_failed");
         SetOutcome(std::string("logcat -S could not be started: ") + strerror(errno));
         return false;
@@ -157,10 +157,10 @@ bool RunLogManager::GetLogFilterDetail(Json::Value& report) {
         if (got < 0) {
             // The statistics read so far still count; a line cut off here does not.
             if (errno == ETIMEDOUT) {
-                OLOGW("%s logcat -S did not end its output within %d s, killed", timing_.commandSeconds);
+                OLOGW_LIMITED("%s logcat -S did not end its output within %d s, killed", timing_.commandSeconds);
                 stats.Add("runlog.timed_out");
             } else {
-                OLOGW("%s reading the output of logcat -S failed: %s", strerror(errno));
+                OLOGW_LIMITED("%s reading the output of logcat -S failed: %s", strerror(errno));
             }
             break;
         }
@@ -169,7 +169,7 @@ bool RunLogManager::GetLogFilterDetail(Json::Value& report) {
         }
         total += static_cast<size_t>(got);
         if (total >= kMaxOutputBytes) {
-            OLOGW("%s logcat -S wrote more than %zu bytes, the rest is not read", kMaxOutputBytes);
+            OLOGW_LIMITED("%s logcat -S wrote more than %zu bytes, the rest is not read", kMaxOutputBytes);
             stats.Add("runlog.output_cut");
             break;
         }
@@ -194,14 +194,14 @@ bool RunLogManager::GetLogFilterDetail(Json::Value& report) {
 unsigned long RunLogManager::NextDelaySeconds() {
     // The directory storage reads the quotas from: the parser keeps one document loaded, and
     // asking it for another would read it anew and reset storage's running log counts.
-    EventQuotaXmlParser::SummaryQuota summary = EventQuotaXmlParser::getInstance()->GetSummaryQuota(
-            *GetPluginContext(), DevInfo::GetQuorVersion());
+    EventQuotaXmlParser::SummaryQuota summary =
+            EventQuotaXmlParser::getInstance()->GetSummaryQuota(*GetPluginContext(), DevInfo::GetQuorVersion());
     period_ = summary.logStatic == 0 ? kDefaultPeriodMinutes : std::min(summary.logStatic, kMaxPeriodMinutes);
     {
         Mutex::Autolock lock(mutex_);
         periodMinutes_ = period_;
     }
-    return static_cast<unsigned long>(period_) * timing_.secondsPerMinute;
+    return static_cast<unsigned long>(period_) * 60 / timing_.speedUp;
 }
 
 void RunLogManager::SetOutcome(const std::string& outcome) {

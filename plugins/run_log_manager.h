@@ -33,8 +33,9 @@ public:
 
     // How long things take; tests shorten them.
     struct Timing {
-        unsigned long secondsPerMinute = 60;  // of the quota document's period
-        int commandSeconds = 30;              // for "logcat -S" to end its output
+        // How many times faster than real time the first delay and the periods pass.
+        unsigned long speedUp = 1;
+        int commandSeconds = 30;  // for "logcat -S" to end its output
     };
 
     RunLogManager() : RunLogManager(Timing()) {}
@@ -63,8 +64,8 @@ private:
     uint32_t period_ = 180;
     ThreadChecker loopThread_;
     Mutex mutex_;
-    uint64_t scheduled_ GUARDED_BY(mutex_) = 0;  // the periodic run that is due
-    int64_t nextRunNs_ GUARDED_BY(mutex_) = 0;   // when it is due, on the monotonic clock
+    uint64_t scheduled_ GUARDED_BY(mutex_) = 0;      // the periodic run that is due
+    int64_t nextRunNs_ GUARDED_BY(mutex_) = 0;       // when it is due, on the monotonic clock
     uint32_t periodMinutes_ GUARDED_BY(mutex_) = 0;  // 0 until the first run read it
     std::string outcome_ GUARDED_BY(mutex_) = "no run yet";
 };
