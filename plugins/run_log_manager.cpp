@@ -3,6 +3,7 @@
 #include <stdio.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
 #include <cstring>
 #include <new>
@@ -37,9 +38,18 @@ constexpr const char* kFlagKey = "persist.sys.log_filter_flag";
 constexpr const char* kTimeGapKey = "persist.sys.log_time_gap_sec";
 constexpr const char* kMaxLineKey = "persist.sys.log_max_line";
 
-// The property's value as a number; -1 when unset.
+// The property's value as a number; -1 when unset or when it does not start with one, so that
+// a property set to a word leaves the filter as unconfigured as an unset one.
 int32_t ReadProperty(PluginContext& context, const char* key) {
-    return StringUtil::ConvertInt(context.GetSysProperity(key, "-1"));
+    std::string text = context.GetSysProperity(key, "-1");
+    size_t digit = text.find_first_not_of(" \t\n\v\f\r");
+    if (digit != std::string::npos && (text[digit] == '+' || text[digit] == '-')) {
+        ++digit;
+    }
+    if (digit >= text.size() || !isdigit(static_cast<unsigned char>(text[digit]))) {
+        return -1;
+    }
+    return StringUtil::ConvertInt(text);
 }
 
 Json::Value DetailOf(const LogFilterRow& row) {
