@@ -5,11 +5,14 @@
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstdint>
+
+#include "utils/orvane_log.h"
 
 extern char** environ;
 
@@ -86,16 +89,32 @@ ssize_t CommandPipe::Read(char* buffer, size_t size, Clock::time_point deadline)
     }
 }
 
-void CommandPipe::Close() {
+bool CommandPipe::Close() {
     output_.reset();
     if (pid_ <= 0) {
-        return;
+        return true;
     }
     // Killed before the leader is reaped: until then the group's id cannot be handed to another.
     kill(-pid_, SIGKILL);
-    while (waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {
+    // SIGKILL ends a program at once unless it sleeps uninterruptibly in the kernel; for such a
+    // one the reader waits a bounded time and then leaves a zombie behind rather than its thread.
+    const Clock::time_point giveUp = Clock::now() + kReapWait;
+    bool reaped = false;
+    while (true) {
+        pid_t got = waitpid(pid_, nullptr, WNOHANG);
+        if (got == pid_ || (got < 0 && errno != EINTR)) {
+            reaped = true;
+            break;
+        }
+        if (Clock::now() >= giveUp) {
+            OLOGW("%s pid %d did not end on SIGKILL, left unreaped", pid_);
+            break;
+        }
+        const struct timespec pause = {0, 10 * 1000 * 1000};
+        nanosleep(&pause, nullptr);
     }
     pid_ = -1;
+    return reaped;
 }
 
 }  // namespace Orvane

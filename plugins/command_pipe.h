@@ -22,6 +22,7 @@ namespace Orvane {
 class CommandPipe {
 public:
     using Clock = std::chrono::steady_clock;
+    static constexpr std::chrono::seconds kReapWait{5};
 
     CommandPipe() = default;
     ~CommandPipe() { Close(); }
@@ -35,9 +36,10 @@ public:
     // an error.
     ssize_t Read(char* buffer, size_t size, Clock::time_point deadline);
     // Closes the pipe, kills what is left of the process group and reaps the program. Whatever
-    // still runs once its output has ended or been given up is of no use to the reader. Does
-    // nothing when nothing runs.
-    void Close();
+    // still runs once its output has ended or been given up is of no use to the reader. True
+    // when nothing runs any more; false, with one warning, when the program did not end within
+    // kReapWait of SIGKILL and was left unreaped.
+    bool Close();
 
 private:
     android::base::unique_fd output_;

@@ -184,7 +184,9 @@ bool RunLogManager::GetLogFilterDetail(Json::Value& report) {
             break;
         }
     }
-    logcat.Close();
+    if (!logcat.Close()) {
+        stats.Add("runlog.unreaped");
+    }
 
     stats.Add("runlog.rows", parser.Rows().size());
     stats.Add("runlog.skipped_lines", parser.SkippedLines());

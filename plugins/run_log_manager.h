@@ -21,7 +21,8 @@ namespace Orvane {
 // 908002001 into "dftFaultEvent". The first run comes 180 s after load, each further one the
 // quota document's "LogStatic" minutes (480 when it says nothing) after the last. The command
 // gets 30 s to finish its output; then it is killed with everything it started, so a hanging
-// log daemon costs the plugin's loop 30 s per run and never the loop itself.
+// log daemon costs the plugin's loop 30 s per run (35 s for one that even SIGKILL cannot end at
+// once) and never the loop itself.
 // "orvanectl dump plugin RunLogManager run" makes a run now; the period then counts from it.
 //
 // Threads: the runs happen on the plugin's own loop only (ThreadChecker); Dump comes from a
