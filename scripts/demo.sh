@@ -4,7 +4,8 @@
 # event.db under the shipped quotas. Starts orvane-devsim and the daemon in a sandbox folder,
 # writes a stream of records, shows what was stored and what was dropped and why, makes CPU
 # pressure that the kernel's pressure stall trigger turns into a performance event (where
-# triggers can be armed), then stops everything it started.
+# triggers can be armed), reports the log filter statistics of a stand-in "logcat -S", then
+# stops everything it started.
 # Assumes `make build` has run. BUILD names the build folder (default: build);
 # ORVANE_DEMO_KEEP=1 keeps the sandbox folder for a look afterwards.
 #
@@ -50,6 +51,30 @@ ro.quor.build.type=1
 ro.serialno=DEMO0001
 persist.sys.orvane.upload_switch=1
 EOF
+# The log filter's statistics: the filter configured, and a stand-in "logcat" first on PATH that
+# prints what the phone's log daemon prints for "logcat -S".
+cat >> "$ORVANE_PROPERTY_FILE" <<'EOF'
+persist.sys.log_filter_flag=1
+persist.sys.log_time_gap_sec=10
+persist.sys.log_max_line=200
+EOF
+mkdir -p "$SANDBOX/bin"
+cat > "$SANDBOX/bin/logcat" <<'EOF'
+#!/bin/sh
+[ "$1" = -S ] || exit 1
+now=$(date +%s)
+cat <<STATS
+size/num main               system              crash
+Total    1.2MB/8123         512KB/2310          0B/0
+Log Filter Top PIDs:
+PID/UID  NAME  FILTERED_LINES FILTER_COUNT MAX_COUNT MAX_TIME
+1843/1000 system_server 5230 41 380 $((now - 3600))
+2710/10089 com.example.chatty 1944 17 260 $((now - 600))
+912/1041 /system/bin/audioserver 310 4 95 $((now - 7200))
+STATS
+EOF
+chmod 755 "$SANDBOX/bin/logcat"
+export PATH=$SANDBOX/bin:$PATH
 
 DEVSIM_PID=
 DAEMON_PID=
@@ -233,6 +258,7 @@ run_demo() {
     fi
 
     run_perf_demo
+    run_log_filter_demo
 
     section "stopping the daemon and the emulator"
     stop_processes
@@ -258,6 +284,9 @@ run_demo() {
         section "the performance event (909001001: CPU pressure, its figures and the busiest processes)"
         sqlite3 "$DB" "select param_list from event_info where event_id = 909001001 limit 1;"
     fi
+
+    section "the log filter statistics (908002001) of the stand-in logcat -S"
+    sqlite3 "$DB" "select param_list from event_info where event_id = 908002001 limit 1;"
 
     section "today's counters (event_daily)"
     sqlite3 -header -column "$DB" \
@@ -305,6 +334,23 @@ run_perf_demo() {
     PRESSURE_PID=
     section "orvanectl dump plugin PerfLogAnalyzer"
     "$BUILD/orvanectl" --workdir "$WORK" dump plugin PerfLogAnalyzer || true
+}
+
+# One run of RunLogManager now instead of 180 s after start: the stand-in's statistics become
+# event 908002001 in dftFaultEvent.
+run_log_filter_demo() {
+    section "log filter statistics: orvanectl dump plugin RunLogManager run"
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin RunLogManager run || return 0
+    filter_stored() {
+        cp "$DB" "$SNAPSHOT" 2> /dev/null &&
+            [ "$(sqlite3 "$SNAPSHOT" "select count(*) from event_info where event_id = 908002001;" 2> /dev/null)" != 0 ]
+    }
+    if wait_for 20 filter_stored; then
+        echo "event 908002001 was stored"
+    else
+        echo "no log filter event within 20 s"
+    fi
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin RunLogManager || true
 }
 
 # Load figures: end-to-end throughput with few and with many distinct ids, then the latency
