@@ -4,6 +4,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 
+#include "config/event_upload_xml_parser.h"
 #include "config/event_xml_parser.h"
 #include "storage/event_table.h"
 #include "utils/dev_info.h"
@@ -65,6 +66,11 @@ bool EventDatabaseHelper::Init(PluginContext* context, const std::string& fileNa
     }
     context_ = context;
     osVersion_ = osVersion;
+    if (!logRuleLookup_) {
+        logRuleLookup_ = [context](uint32_t eventId) {
+            return EventUploadXmlParser::getInstance()->HasLogRules(*context, eventId);
+        };
+    }
     dbPath_ = context->GetWorkDir() + fileName;
     database_ = EventDatabase::getInstance();
     database_->InitDatabase(dbPath_);

@@ -134,19 +134,19 @@ bool ZipPack::AddFileContentToZip(const std::string& path) {
     return CopyToEntry(fd.get(), path);
 }
 
-bool ZipPack::AddFileFromFd(int fd, const std::string& entryName) {
+bool ZipPack::AddFileFromFd(int fd, const std::string& entryName, uint64_t maxBytes) {
     if (zipHandle_ == nullptr || fd < 0 || !OpenNewFileInZip(zipHandle_, entryName)) {
         return false;
     }
     // The entry is closed even when copying failed, leaving what was copied.
-    bool copied = CopyToEntry(fd, entryName);
+    bool copied = CopyToEntry(fd, entryName, maxBytes);
     return CloseNewFileEntry(zipHandle_) && copied;
 }
 
-bool ZipPack::CopyToEntry(int fd, const std::string& what) {
+bool ZipPack::CopyToEntry(int fd, const std::string& what, uint64_t maxBytes) {
     char buffer[kCopyBufferSize];
-    while (true) {
-        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buffer, sizeof(buffer)));
+    while (maxBytes > 0) {
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buffer, std::min<uint64_t>(sizeof(buffer), maxBytes)));
         if (n == 0) {
             return true;
         }
@@ -159,7 +159,9 @@ bool ZipPack::CopyToEntry(int fd, const std::string& what) {
             OLOGI("%s Could not write data to zip for path:%s ", what.c_str());
             return false;
         }
+        maxBytes -= static_cast<uint64_t>(n);
     }
+    return true;
 }
 
 void ZipPack::Close() {
