@@ -5,6 +5,7 @@
 #include <cstring>
 #include <string>
 
+#include <android-base/unique_fd.h>
 #include <benchmark/benchmark.h>
 
 #include "config/event_xml_parser.h"
@@ -51,12 +52,11 @@ public:
     size_t Size() const { return size_; }
     // Gives the last entry a new 9-digit id.
     void SetLastId(uint32_t id) const {
-        int fd = open(Path().c_str(), O_WRONLY);
+        android::base::unique_fd fd(open(Path().c_str(), O_WRONLY | O_CLOEXEC));
         std::string digits = std::to_string(id);
         if (fd < 0 || pwrite(fd, digits.data(), digits.size(), static_cast<off_t>(lastIdOffset_)) < 0) {
             fprintf(stderr, "cannot rewrite %s\n", Path().c_str());
         }
-        close(fd);
     }
 
 private:

@@ -3,14 +3,14 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <fstream>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include <benchmark/benchmark.h>
+#include <utils/Condition.h>
+#include <utils/Mutex.h>
 
 #include "platform/pipeline.h"
 #include "platform/plugin_factory.h"
@@ -24,25 +24,27 @@ namespace {
 class Finish {
 public:
     void Arrive() {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         if (++count_ >= target_) {
-            done_.notify_one();
+            done_.signal();
         }
     }
     void Expect(uint64_t more) {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         target_ = count_ + more;
     }
     void Wait() {
-        std::unique_lock<std::mutex> lock(mutex_);
-        done_.wait(lock, [this] { return count_ >= target_; });
+        Mutex::Autolock lock(mutex_);
+        while (count_ < target_) {
+            done_.wait(mutex_);
+        }
     }
 
 private:
-    std::mutex mutex_;
-    std::condition_variable done_;
-    uint64_t count_ = 0;
-    uint64_t target_ = 0;
+    Mutex mutex_;
+    Condition done_;
+    uint64_t count_ GUARDED_BY(mutex_) = 0;
+    uint64_t target_ GUARDED_BY(mutex_) = 0;
 };
 
 class BenchStep : public Plugin {

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include <android-base/unique_fd.h>
 #include <android/log.h>
 #include <benchmark/benchmark.h>
 
@@ -54,7 +55,7 @@ struct Fixture {
         }
         platform.ParseArgs(static_cast<int>(argv.size()), argv.data());
         platform.StartPlatform();
-        server = new HostBinderServer();
+        server = new HostBinderServer(platform.GetStats());
         server->AddService(SocketPath(), new OrvaneNativeService(new OrvaneService(&platform), false));
         server->StartThreadPool(4);
     }
@@ -94,25 +95,22 @@ BENCHMARK(BM_NotifyUploadSwitch)->Repetitions(5)->ReportAggregatesOnly(true)->Us
 void BM_DumpSummary(benchmark::State& state) {
     __android_log_set_minimum_priority(ANDROID_LOG_WARN);
     HostBinderClient client;
-    int pipeFds[2];
-    if (!client.Connect(GetFixture().SocketPath()) || pipe2(pipeFds, O_CLOEXEC) != 0) {
+    android::base::unique_fd readEnd, writeEnd;
+    if (!client.Connect(GetFixture().SocketPath()) || !android::base::Pipe(&readEnd, &writeEnd)) {
         state.SkipWithError("no service socket");
         return;
     }
     Parcel data;
-    data.writeFileDescriptor(pipeFds[1]);
+    data.writeFileDescriptor(writeEnd);
     data.writeInt32(0);
     Parcel reply;
     char text[4096];
     for (auto _ : state) {
-        if (client.Transact(IBinder::DUMP_TRANSACTION, data, &reply) != OK ||
-            read(pipeFds[0], text, sizeof(text)) <= 0) {
+        if (client.Transact(IBinder::DUMP_TRANSACTION, data, &reply) != OK || read(readEnd, text, sizeof(text)) <= 0) {
             state.SkipWithError("dump failed");
             break;
         }
     }
-    close(pipeFds[0]);
-    close(pipeFds[1]);
 }
 BENCHMARK(BM_DumpSummary)->Repetitions(5)->ReportAggregatesOnly(true)->UseRealTime();
 

@@ -1,15 +1,19 @@
 #include "config/config_document.h"
 
+#include <cstring>
 #include <map>
 
 #include <utils/Mutex.h>
 
 #include "config/xml_parser.h"
 #include "utils/orvane_log.h"
+#include "utils/string_util.h"
 
 namespace android {
 namespace Orvane {
 namespace {
+
+constexpr char kArchiveSuffix[] = ".zip";
 
 // Accepts no element, so the reader feeds the whole document and reports only whether it parsed.
 class WellFormedCheck : public XmlParser {
@@ -26,6 +30,15 @@ struct Verdict {
 Mutex gVerdictMutex;
 std::map<std::string, Verdict> gVerdicts GUARDED_BY(gVerdictMutex);
 
+// An archive "dir/x.zip" holds the document as its entry "x.xml"; "" for a plain document.
+std::string ArchiveEntry(const std::string& path) {
+    if (!StringUtil::EndsWith(path, kArchiveSuffix)) {
+        return "";
+    }
+    size_t name = path.rfind('/') + 1;  // npos + 1 is 0
+    return path.substr(name, path.size() - strlen(kArchiveSuffix) - name) + ".xml";
+}
+
 // The verdict for this version of the file; `fresh` tells whether it was found just now.
 bool CheckWellFormed(const std::string& path, const FileStamp& stamp, bool& fresh) {
     {
@@ -37,7 +50,8 @@ bool CheckWellFormed(const std::string& path, const FileStamp& stamp, bool& fres
         }
     }
     sp<WellFormedCheck> check = new WellFormedCheck();
-    bool wellFormed = check->ParserXmlFile(path, true) == 0;
+    std::string entry = ArchiveEntry(path);
+    bool wellFormed = (entry.empty() ? check->ParserXmlFile(path, true) : check->ParserZipXmlFile(path, entry)) == 0;
     Mutex::Autolock lock(gVerdictMutex);
     gVerdicts[path] = {stamp, wellFormed};
     fresh = true;
@@ -46,32 +60,40 @@ bool CheckWellFormed(const std::string& path, const FileStamp& stamp, bool& fres
 
 }  // namespace
 
+DocumentFolders::DocumentFolders(PluginContext& context)
+    : cloudDir(context.GetCloudConfigDir()), configDir(context.GetConfigDir()), stats(&context.GetStats()) {}
+
+DocumentFolders::DocumentFolders(const std::string& directory) : cloudDir(directory), configDir(directory) {}
+
+void DocumentFolders::Count(const char* what, const std::string& fileName) const {
+    if (stats != nullptr) {
+        stats->Add(std::string("config.") + what + "." + fileName);
+    }
+}
+
 bool ConfigDocument::IsWellFormed(const std::string& path, const FileStamp& stamp) {
     bool fresh = false;
     return CheckWellFormed(path, stamp, fresh);
 }
 
-DocumentChoice ConfigDocument::Choose(const std::string& cloudDir, const std::string& configDir,
-                                      const std::string& fileName, DaemonStats* stats) {
-    DocumentChoice cloud{cloudDir, cloudDir + fileName, FileUtil::GetFileStamp(cloudDir + fileName), true};
-    if (cloud.stamp.size >= 0 && cloudDir != configDir) {
+DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std::string& fileName) {
+    const std::string& configDir = folders.configDir;
+    if (folders.cloudDir != configDir) {
+        DocumentChoice cloud{folders.cloudDir, folders.cloudDir + fileName, {}, true};
+        cloud.stamp = FileUtil::GetFileStamp(cloud.path);
         bool fresh = false;
-        if (CheckWellFormed(cloud.path, cloud.stamp, fresh)) {
+        if (cloud.stamp.size >= 0 && CheckWellFormed(cloud.path, cloud.stamp, fresh)) {
             return cloud;
         }
         if (fresh) {  // once per version of the broken copy
             OLOGW("%s cloud copy %s does not parse, %s%s is used", cloud.path.c_str(), configDir.c_str(),
                   fileName.c_str());
-            if (stats != nullptr) {
-                stats->Add("config.cloud_rejected." + fileName);
-            }
+            folders.Count("cloud_rejected", fileName);
         }
     }
-    return {configDir, configDir + fileName, FileUtil::GetFileStamp(configDir + fileName), false};
-}
-
-DocumentChoice ConfigDocument::Choose(PluginContext& context, const std::string& fileName) {
-    return Choose(context.GetCloudConfigDir(), context.GetConfigDir(), fileName, &context.GetStats());
+    DocumentChoice system{configDir, configDir + fileName, {}, false};
+    system.stamp = FileUtil::GetFileStamp(system.path);
+    return system;
 }
 
 }  // namespace Orvane

@@ -10,6 +10,9 @@ namespace {
 
 constexpr uint32_t kIdsPerDomain = 1000000;
 constexpr uint32_t kFallbackLogCntLimit = 10;
+// Counts kept for ranges that the document in force leaves out; beyond this many (far more than
+// a document has ranges) they are let go, so that a stream of documents cannot grow the memory.
+constexpr size_t kMaxKeptLogCounters = 4096;
 
 // The attribute's value when it is a number of 1 or more; otherwise the default.
 void InitValue(const std::map<std::string, std::string>& attributes, const std::string& key, uint32_t& field,
@@ -49,16 +52,24 @@ sp<EventQuotaXmlParser> EventQuotaXmlParser::getInstance() {
     return instance;
 }
 
-int32_t EventQuotaXmlParser::StartParserXml(const std::string& directory, const std::string& section) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return LoadLocked(directory, section);
+int32_t EventQuotaXmlParser::StartParserXml(const DocumentFolders& folders, const std::string& section) {
+    Mutex::Autolock lock(mutex_);
+    return LoadLocked(folders, section);
 }
 
-// Reads the document once per directory and section; a new one replaces everything read from
-// the last one (the fallback counters do not come from the document and are kept).
-int32_t EventQuotaXmlParser::LoadLocked(const std::string& directory, const std::string& section) {
-    if (loaded_ && directory == loadedDirectory_ && section == section_) {
+// Reads the chosen copy's section when the copy, its version or the section changed; the new
+// document replaces everything read from the last one, except the log counters (see the class).
+int32_t EventQuotaXmlParser::LoadLocked(const DocumentFolders& folders, const std::string& section) {
+    DocumentChoice choice = ConfigDocument::Choose(folders, GetFileName());
+    if (loaded_ && choice.SameVersion(loadedDocument_) && section == section_) {
         return loadResult_;
+    }
+    for (const auto& [key, count] : LogCounters()) {
+        if (*count != 0) {
+            keptLogCnt_[key] = *count;
+        } else {
+            keptLogCnt_.erase(key);
+        }
     }
     summary_ = SummaryQuota();
     domains_.clear();
@@ -66,20 +77,46 @@ int32_t EventQuotaXmlParser::LoadLocked(const std::string& directory, const std:
     eventDailyCnt_.clear();
     currentDomain_.clear();
     section_ = section;
-    loadedDirectory_ = directory;
+    loadedDocument_ = choice;
     loaded_ = true;
-    std::string path = directory + GetFileName();
-    loadResult_ = ParserXmlFile(path, true);
+    loadResult_ = ParserXmlFile(choice.path, true);
     if (loadResult_ != 0) {
-        OLOG_AS(ANDROID_LOG_WARN, "StartParserXml", "%s parse xml file failed %s", path.c_str());
+        OLOG_AS(ANDROID_LOG_WARN, "StartParserXml", "%s parse xml file failed %s", choice.path.c_str());
+        folders.Count("read_failed", GetFileName());
+    }
+    for (const auto& [key, count] : LogCounters()) {
+        auto kept = keptLogCnt_.find(key);
+        if (kept != keptLogCnt_.end()) {
+            *count = kept->second;
+        }
+    }
+    if (keptLogCnt_.size() > kMaxKeptLogCounters) {
+        keptLogCnt_.clear();  // the counts of this document's ranges live on in its records
     }
     return loadResult_;
 }
 
-EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::GetEventQuota(const std::string& directory,
+std::vector<std::pair<EventQuotaXmlParser::CounterKey, int32_t*>> EventQuotaXmlParser::LogCounters() {
+    std::vector<std::pair<CounterKey, int32_t*>> counters;
+    std::map<CounterKey, uint32_t> places;  // records met so far of each kind and bounds
+    auto add = [&counters, &places](bool sub, DomainQuota& quota) {
+        CounterKey key{sub, quota.eventMin, quota.eventMax, 0};
+        std::get<3>(key) = places[key]++;
+        counters.emplace_back(key, &quota.logCnt);
+    };
+    for (auto& [name, domain] : domains_) {
+        add(false, domain);
+    }
+    for (DomainQuota& sub : subDomains_) {
+        add(true, sub);
+    }
+    return counters;
+}
+
+EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::GetEventQuota(const DocumentFolders& folders,
                                                                     const std::string& section, uint32_t id) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    LoadLocked(directory, section);
+    Mutex::Autolock lock(mutex_);
+    LoadLocked(folders, section);
     DomainQuota record;
     auto event = eventDailyCnt_.find(id);
     bool eventDaily = event != eventDailyCnt_.end();
@@ -133,17 +170,17 @@ EventQuotaXmlParser::DomainQuota EventQuotaXmlParser::GetEventQuota(const std::s
     return record;
 }
 
-EventQuotaXmlParser::SummaryQuota EventQuotaXmlParser::GetSummaryQuota(const std::string& directory,
+EventQuotaXmlParser::SummaryQuota EventQuotaXmlParser::GetSummaryQuota(const DocumentFolders& folders,
                                                                        const std::string& section) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    LoadLocked(directory, section);
+    Mutex::Autolock lock(mutex_);
+    LoadLocked(folders, section);
     return summary_;
 }
 
-bool EventQuotaXmlParser::CheckLogCntLimitAfterIncr(const std::string& directory, const std::string& section,
+bool EventQuotaXmlParser::CheckLogCntLimitAfterIncr(const DocumentFolders& folders, const std::string& section,
                                                     uint32_t id, int32_t incr, DomainQuota* record) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    LoadLocked(directory, section);
+    Mutex::Autolock lock(mutex_);
+    LoadLocked(folders, section);
     if (record != nullptr) {
         *record = DomainQuota();
     }

@@ -127,8 +127,13 @@ std::map<std::string, std::string> EventXmlParser::ExtractAttributes(const std::
     return attributes;
 }
 
-sp<EventInfoConfig> EventXmlParser::GetEventInfoConfig(const std::string& directory, uint32_t id) {
-    std::lock_guard<std::mutex> lock(lookupMutex_);
+sp<EventInfoConfig> EventXmlParser::GetEventInfoConfig(const DocumentFolders& folders, uint32_t id) {
+    Mutex::Autolock lock(lookupMutex_);
+    DocumentChoice choice = ConfigDocument::Choose(folders, GetFileName());
+    if (!choice.SameVersion(cachedDocument_)) {
+        cache_.clear();
+        cachedDocument_ = choice;
+    }
     auto cached = cache_.find(id);
     if (cached != cache_.end()) {
         return cached->second;
@@ -137,11 +142,13 @@ sp<EventInfoConfig> EventXmlParser::GetEventInfoConfig(const std::string& direct
     found_ = false;
     wantedId_ = id;
     uint64_t start = TimeUtil::GetTimestampUS();
-    int32_t ret = GetFileName() == "event.zip" ? ParserZipXmlFile(directory + "event.zip", "event.xml")
-                                               : ParserXmlFile(directory + GetFileName(), false);
+    int32_t ret = GetFileName() == "event.zip" ? ParserZipXmlFile(choice.path, "event.xml")
+                                               : ParserXmlFile(choice.path, false);
     sp<EventInfoConfig> entry = building_;
     if (ret != 0) {
-        OLOGW("%s upload failed, %s, %s", directory.c_str(), "event.xml");
+        // Every lookup of a missing or unreadable catalogue meets this.
+        OLOGW_LIMITED("%s upload failed, %s, %s", choice.directory.c_str(), "event.xml");
+        folders.Count("read_failed", GetFileName());
         building_.clear();
         return nullptr;
     }

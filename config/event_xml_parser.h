@@ -3,12 +3,13 @@
 
 #include <cstdint>
 #include <map>
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include <utils/Mutex.h>
 #include <utils/RefBase.h>
 
+#include "config/config_document.h"
 #include "config/xml_parser.h"
 
 namespace android {
@@ -72,7 +73,9 @@ public:
 };
 
 // Looks up single events of the catalogue "event.xml" on demand, reading the document only up
-// to the wanted entry, and keeps the 50 most expensive lookups cached.
+// to the wanted entry, and keeps the 50 most expensive lookups cached. Every lookup chooses the
+// copy in force (ConfigDocument::Choose); the cache holds entries of one version of one copy and
+// is dropped when the choice changes.
 //
 // Concurrency: GetEventInfoConfig may be called from any thread; one lock of this parser covers
 // the whole lookup (cache, entry being built, document reading), taken before the document lock.
@@ -80,33 +83,35 @@ class EventXmlParser : public XmlParser {
 public:
     static sp<EventXmlParser> getInstance();
 
-    // The catalogue entry of id from directory (ending in "/"), or null when the document
-    // cannot be read or does not hold the id.
-    sp<EventInfoConfig> GetEventInfoConfig(const std::string& directory, uint32_t id);
+    // The catalogue entry of id from the copy in force, or null when the document cannot be read
+    // or does not hold the id.
+    sp<EventInfoConfig> GetEventInfoConfig(const DocumentFolders& folders, uint32_t id) EXCLUDES(lookupMutex_);
     static uint32_t GetParamType(const std::string& type);
     // The name="value" pairs of one start tag, read the way the pattern (\S+)="(.+?)" finds
     // them (a later name wins), in linear time however long or hostile the text is.
     static std::map<std::string, std::string> ExtractAttributes(const std::string& tag);
 
     // Reached through XmlParser while a document is read.
-    bool IsMatch(const std::string& name) override;
-    bool OnProcess(const std::string& text) override;
-    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override;
-    void OnEndElement(const std::string& name) override;
+    bool IsMatch(const std::string& name) REQUIRES(gXmlDocumentMutex) override;
+    bool OnProcess(const std::string& text) REQUIRES(lookupMutex_, gXmlDocumentMutex) override;
+    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes)
+            REQUIRES(lookupMutex_, gXmlDocumentMutex) override;
+    void OnEndElement(const std::string& name) REQUIRES(lookupMutex_, gXmlDocumentMutex) override;
 
 private:
     static constexpr size_t kCacheSize = 50;
 
     EventXmlParser() : XmlParser("event.xml") {}
-    void InitEventInfoConfig(const std::map<std::string, std::string>& attributes);
-    void AddEventParamInfoCfg(const std::map<std::string, std::string>& attributes);
-    void SaveEventInfo(uint32_t id);
+    void InitEventInfoConfig(const std::map<std::string, std::string>& attributes) REQUIRES(lookupMutex_);
+    void AddEventParamInfoCfg(const std::map<std::string, std::string>& attributes) REQUIRES(lookupMutex_);
+    void SaveEventInfo(uint32_t id) REQUIRES(lookupMutex_);
 
-    std::mutex lookupMutex_;
-    sp<EventInfoConfig> building_;
-    bool found_ = false;
-    uint32_t wantedId_ = 0;
-    std::map<uint32_t, sp<EventInfoConfig>> cache_;
+    Mutex lookupMutex_;
+    sp<EventInfoConfig> building_ GUARDED_BY(lookupMutex_);
+    bool found_ GUARDED_BY(lookupMutex_) = false;
+    uint32_t wantedId_ GUARDED_BY(lookupMutex_) = 0;
+    std::map<uint32_t, sp<EventInfoConfig>> cache_ GUARDED_BY(lookupMutex_);
+    DocumentChoice cachedDocument_ GUARDED_BY(lookupMutex_);  // the copy whose entries cache_ holds
 };
 
 }  // namespace Orvane

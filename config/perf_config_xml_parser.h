@@ -46,8 +46,9 @@ public:
     // line) when the document cannot be read or parsed, with whatever was valid before the error.
     static bool Read(const std::string& path, std::vector<PerfResourceConfig>& resources, DaemonStats* stats);
 
-    bool IsMatch(const std::string& name) override;
-    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override;
+    bool IsMatch(const std::string& name) override REQUIRES(gXmlDocumentMutex);
+    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override
+            REQUIRES(gXmlDocumentMutex);
 
 private:
     explicit PerfConfigXmlParser(DaemonStats* stats) : XmlParser(kFileName), stats_(stats) {}

@@ -69,7 +69,7 @@ public:
             error = "not well-formed XML";
         } else if (!error_.empty()) {
             error = error_;
-        } else if (!IsStart()) {
+        } else if (!sawRoot_) {
             error = std::string("no ") + kRootElement + " element";
         } else if (!sawLevels_) {
             error = "no Levels element";
@@ -81,16 +81,18 @@ public:
         return policy_;
     }
 
-    bool IsMatch(const std::string& name) override {
+    bool IsMatch(const std::string& name) override REQUIRES(gXmlDocumentMutex) {
         if (name == kRootElement) {
             SetStart();
+            sawRoot_ = true;
             return true;
         }
         Refuse("root element " + name + " is not " + kRootElement);
         return false;
     }
 
-    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override {
+    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override
+            REQUIRES(gXmlDocumentMutex) {
         if (!error_.empty()) {
             return;
         }
@@ -136,31 +138,33 @@ public:
         // Other elements are left to newer readers.
     }
 
-    void OnEndElement(const std::string& name) override {
+    void OnEndElement(const std::string& name) override REQUIRES(gXmlDocumentMutex) {
         if (name == section_) {
             section_.clear();
         }
     }
 
 private:
-    void Refuse(const std::string& why) {
+    void Refuse(const std::string& why) REQUIRES(gXmlDocumentMutex) {
         if (error_.empty()) {
             error_ = why;
         }
         SetFinish();
     }
-    void Require(bool condition, const std::string& why) {
+    void Require(bool condition, const std::string& why) REQUIRES(gXmlDocumentMutex) {
         if (!condition) {
             Refuse(why);
         }
     }
-    bool InSection(const char* section, const std::string& element) {
+    bool InSection(const char* section, const std::string& element) REQUIRES(gXmlDocumentMutex) {
         Require(section_ == section, element + " outside " + section);
         return section_ == section;
     }
-    void Count(size_t entries) { Require(entries <= kMaxListEntries, "a list longer than 1024 entries"); }
+    void Count(size_t entries) REQUIRES(gXmlDocumentMutex) {
+        Require(entries <= kMaxListEntries, "a list longer than 1024 entries");
+    }
 
-    void ReadAction(const std::string& action) {
+    void ReadAction(const std::string& action) REQUIRES(gXmlDocumentMutex) {
         if (action == "keep") {
             policy_->unchecked = UncheckedAction::kKeep;
         } else if (action == "strip") {
@@ -172,7 +176,7 @@ private:
         }
     }
 
-    void ReadIdentifiers(const std::map<std::string, std::string>& attributes) {
+    void ReadIdentifiers(const std::map<std::string, std::string>& attributes) REQUIRES(gXmlDocumentMutex) {
         section_ = "Identifiers";
         policy_->keyFile = GetAttribute(attributes, "key");
         Require(policy_->keyFile.find('/') == std::string::npos, "the key names a file of the configuration folder");
@@ -183,7 +187,7 @@ private:
         }
     }
 
-    void ReadFilterName(const std::string& value, const std::string& pattern) {
+    void ReadFilterName(const std::string& value, const std::string& pattern) REQUIRES(gXmlDocumentMutex) {
         if (!InSection("FilterList", "Name") || value.empty() == pattern.empty()) {
             Refuse("Name needs one of value and pattern");
         } else if (!value.empty()) {
@@ -198,6 +202,7 @@ private:
     std::shared_ptr<PrivacyPolicy> policy_;
     std::string section_;
     std::string error_;
+    bool sawRoot_ = false;  // read after the reading, when the document lock is no longer held
     bool sawLevels_ = false;
 };
 
@@ -296,9 +301,9 @@ std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::ReadPolicy(const std::
     return policy;
 }
 
-std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const std::string& cloudDir,
-                                                                    const std::string& configDir, DaemonStats* stats) {
-    DocumentChoice choice = ConfigDocument::Choose(cloudDir, configDir, kFileName, stats);
+std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const DocumentFolders& folders) {
+    DocumentChoice choice = ConfigDocument::Choose(folders, kFileName);
+    DaemonStats* stats = folders.stats;
     Mutex::Autolock lock(mutex_);
     if (tried_ && choice.path == loadedPath_ && choice.stamp == loadedStamp_) {
         return current_ != nullptr ? current_ : PrivacyPolicy::Safest();
@@ -323,10 +328,6 @@ std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(const std::s
         }
     }
     return current_ != nullptr ? current_ : PrivacyPolicy::Safest();
-}
-
-std::shared_ptr<const PrivacyPolicy> PrivacyPolicyParser::GetPolicy(PluginContext& context) {
-    return GetPolicy(context.GetCloudConfigDir(), context.GetConfigDir(), &context.GetStats());
 }
 
 }  // namespace Orvane

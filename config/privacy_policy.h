@@ -10,6 +10,7 @@
 
 #include <utils/Mutex.h>
 
+#include "config/config_document.h"
 #include "config/event_xml_parser.h"
 #include "platform/plugin_context.h"
 #include "utils/daemon_stats.h"
@@ -82,9 +83,8 @@ public:
     // A parser of its own, for tests that need a fresh history.
     PrivacyPolicyParser() = default;
 
-    std::shared_ptr<const PrivacyPolicy> GetPolicy(const std::string& cloudDir, const std::string& configDir,
-                                                   DaemonStats* stats);
-    std::shared_ptr<const PrivacyPolicy> GetPolicy(PluginContext& context);
+    // The policy in force for these folders (a PluginContext converts: the daemon's folders).
+    std::shared_ptr<const PrivacyPolicy> GetPolicy(const DocumentFolders& folders);
 
     // One document read on its own: the policy, or null with `error` saying why. The key file
     // named by the document is looked up in `keyDir`.

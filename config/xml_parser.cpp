@@ -2,7 +2,6 @@
 
 #include <cstdio>
 #include <cstring>
-#include <mutex>
 
 #include <libxml/parser.h>
 
@@ -13,21 +12,21 @@
 namespace android {
 namespace Orvane {
 
+Mutex gXmlDocumentMutex;
+
 namespace {
 
 constexpr size_t kBlockSize = 4096;
 constexpr size_t kFirstBytes = 4;
 
-// Serialises all document reading: libxml2 is initialised and cleaned up around every document,
-// which must not overlap with another reader.
-std::mutex gDocumentMutex;
-
 const char* OrEmpty(const xmlChar* text) {
     return text != nullptr ? reinterpret_cast<const char*>(text) : "";
 }
 
+// libxml2's element callbacks, called from xmlParseChunk while a reader holds the document lock.
 void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI, int nb_namespaces,
-                      const xmlChar** namespaces, int nb_attributes, int nb_defaulted, const xmlChar** attributes) {
+                      const xmlChar** namespaces, int nb_attributes, int nb_defaulted, const xmlChar** attributes)
+        REQUIRES(gXmlDocumentMutex) {
     XmlParser* parser = static_cast<XmlParser*>(ctx);
     if (parser == nullptr) {
         OLOGD("%s local=%s parser is null. pre=%s,uri=%s,nb=%d,ns=%p,nb_de=%d", OrEmpty(localname), OrEmpty(prefix),
@@ -52,7 +51,8 @@ void OnStartElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix
     parser->OnStartElement(name, attrs);
 }
 
-void OnEndElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI) {
+void OnEndElementNs(void* ctx, const xmlChar* localname, const xmlChar* prefix, const xmlChar* URI)
+        REQUIRES(gXmlDocumentMutex) {
     XmlParser* parser = static_cast<XmlParser*>(ctx);
     if (parser == nullptr) {
         OLOGI("%s parser is null. pre=%s,uri=%s", OrEmpty(prefix), OrEmpty(URI));
@@ -80,8 +80,8 @@ xmlParserCtxtPtr CreatePushParser(xmlSAXHandler& handler, XmlParser* parser, con
     return ctxt;
 }
 
-// Frees the parser and the document libxml2 builds on its own for a DOCTYPE that declares
-// entities, which freeing the parser alone leaves behind.
+// Frees the context with the document libxml2 builds on its own to keep a DOCTYPE's entity
+// declarations (for expat compatibility); nothing here uses them, and the context leaves it behind.
 void FreePushParser(xmlParserCtxtPtr ctxt) {
     if (ctxt->myDoc != nullptr) {
         xmlFreeDoc(ctxt->myDoc);
@@ -126,14 +126,14 @@ std::string XmlParser::GetAttribute(const std::map<std::string, std::string>& at
 }
 
 int32_t XmlParser::ParserXmlFile(const std::string& path, bool elementMode) {
-    std::lock_guard<std::mutex> lock(gDocumentMutex);
+    Mutex::Autolock lock(gXmlDocumentMutex);
     ClearFlags();
     sp<XmlParser> self(this);
     return elementMode ? ReadXmlFile(path, self) : ReadXmlFileWithBuf(path, self);
 }
 
 int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::string& entryName) {
-    std::lock_guard<std::mutex> lock(gDocumentMutex);
+    Mutex::Autolock lock(gXmlDocumentMutex);
     ZipReader reader;
     if (!reader.Open(zipPath)) {
         return -1;
@@ -150,17 +150,18 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     }
     bool entrySeen = false;
     bool failed = false;
-    auto consumer = [&](const char* data, uint32_t, int32_t length) -> int {
+    // Runs inside ExtractFile, below, with the document lock held.
+    auto consumer = [&](const char* data, uint32_t, int32_t length) REQUIRES(gXmlDocumentMutex) -> int {
         if (length < 0) {
             failed = true;
             return -1;
         }
         entrySeen = true;
         if (xmlParseChunk(ctxt, data, length, length == 0 ? 1 : 0) != 0 && !failed) {
-            // Logged once: a broken document would otherwise repeat the line for every block.
+            // Once per document (not per block), and collapsed when documents are read per lookup.
             xmlParserError(ctxt, "xmlParseChunk");
-            OLOG_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s",
-                    std::string(data, length).c_str());
+            OLOG_LIMITED_AS(ANDROID_LOG_ERROR, "operator()", "%s xml parse chunk failed: %s",
+                            std::string(data, length).c_str());
             failed = true;
         }
         return IsFinish() ? 1 : 0;
@@ -171,7 +172,7 @@ int32_t XmlParser::ParserZipXmlFile(const std::string& zipPath, const std::strin
     xmlCleanupParser();
     reader.Close();
     if (extracted && !entrySeen) {
-        OLOGE("%s no entry %s in %s", entryName.c_str(), zipPath.c_str());
+        OLOGE_LIMITED("%s no entry %s in %s", entryName.c_str(), zipPath.c_str());
         return -1;
     }
     return (extracted && !failed) ? 0 : -1;
@@ -224,7 +225,8 @@ int32_t ReadXmlFileWithBuf(const std::string& path, const sp<XmlParser>& parser)
     ScopedTrace trace(TraceName("ReadXmlFileWithBuf ", path));
     FILE* file = fopen(path.c_str(), "rb");
     if (file == nullptr) {
-        OLOGE("%s not open file %s", path.c_str());
+        // Text mode serves lookups made per event: a missing catalogue would repeat this for each.
+        OLOGE_LIMITED("%s not open file %s", path.c_str());
         return -1;
     }
     FileCloser closer(file);

@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cstring>
 #include <fstream>
 #include <regex>
 
@@ -21,14 +22,132 @@ const std::regex& HeaderExpression() {
     return kExpression;
 }
 
-const std::regex& PluginExpression() {
-    static const std::regex kExpression("([^\\[]+)\\[([^\\[:]*):?([^:]*)\\]\\s*:(\\d+)\\s+(dynamic|static)");
-    return kExpression;
+bool IsBlank(char c) {  // \s
+    return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
 }
 
-const std::regex& PipelineExpression() {
-    static const std::regex kExpression("(\\S+)\\s*:(.+)");
-    return kExpression;
+bool IsDigit(char c) {
+    return c >= '0' && c <= '9';
+}
+
+// The plugin and pipeline lines are matched by hand, exactly as searching them with their
+// expressions would match (same leftmost match, same groups), because the expressions'
+// backtracking takes seconds on a hostile line of 1 KiB, and every line of a pushed configuration
+// would pay that at start-up. Both run in linear time per candidate start.
+
+// "\s*(\d+)\s+(dynamic|static)" minus the blanks, from `from`: the digits and the word.
+bool MatchDelayAndKind(const std::string& line, size_t from, std::string groups[5]) {
+    size_t digitsEnd = from;
+    while (digitsEnd < line.size() && IsDigit(line[digitsEnd])) {
+        digitsEnd++;
+    }
+    size_t word = digitsEnd;
+    while (word < line.size() && IsBlank(line[word])) {
+        word++;
+    }
+    if (digitsEnd == from || word == digitsEnd) {
+        return false;
+    }
+    for (const char* kind : {"dynamic", "static"}) {
+        if (line.compare(word, strlen(kind), kind) == 0) {
+            groups[3] = line.substr(from, digitsEnd - from);
+            groups[4] = kind;
+            return true;
+        }
+    }
+    return false;
+}
+
+// "\[([^\[:]*):?([^:]*)\]\s*:..." at the '[' at `open`. Group 3 can hold no ':', and only blanks
+// may stand between its ']' and the next ':', so for a group 3 starting at `from` that colon is
+// the first one at or after `from`, and the ']' is the last non-blank before it.
+bool MatchAfterBracket(const std::string& line, size_t open, std::string groups[5]) {
+    auto closeBefore = [&line](size_t from, size_t colon) {  // the ']' before colon, or npos
+        size_t end = colon;
+        while (end > from && IsBlank(line[end - 1])) {
+            end--;
+        }
+        return end > from && line[end - 1] == ']' ? end - 1 : std::string::npos;
+    };
+    size_t stop = std::min(line.find_first_of("[:", open + 1), line.size());  // group 2 ends by here
+    if (stop < line.size() && line[stop] == ':') {
+        // Longest group 2 with the optional ':' taken; else a shorter group 2 and an empty group 3
+        // right before that ':'.
+        size_t colon = line.find(':', stop + 1);
+        size_t close = colon == std::string::npos ? colon : closeBefore(stop + 1, colon);
+        if (close != std::string::npos && MatchDelayAndKind(line, colon + 1, groups)) {
+            groups[1] = line.substr(open + 1, stop - open - 1);
+            groups[2] = line.substr(stop + 1, close - stop - 1);
+            return true;
+        }
+        close = closeBefore(open + 1, stop);
+        if (close == std::string::npos || !MatchDelayAndKind(line, stop + 1, groups)) {
+            return false;
+        }
+        groups[1] = line.substr(open + 1, close - open - 1);
+        groups[2].clear();
+        return true;
+    }
+    // No ':' in group 2's reach: group 3 starts at the '[' that ends group 2 (at the line's end
+    // nothing is left for it).
+    size_t colon = line.find(':', stop);
+    size_t close = colon == std::string::npos ? colon : closeBefore(stop, colon);
+    if (close == std::string::npos || !MatchDelayAndKind(line, colon + 1, groups)) {
+        return false;
+    }
+    groups[1] = line.substr(open + 1, stop - open - 1);
+    groups[2] = line.substr(stop, close - stop);
+    return true;
+}
+
+// "([^\[]+)\[([^\[:]*):?([^:]*)\]\s*:(\d+)\s+(dynamic|static)": group 1 runs from the start of a
+// '['-free stretch to the '[' that ends it, so each '[' is tried once.
+bool MatchPluginLine(const std::string& line, std::string groups[5]) {
+    size_t stretch = 0;
+    for (size_t open = line.find('['); open != std::string::npos; stretch = open + 1, open = line.find('[', open + 1)) {
+        if (open > stretch && MatchAfterBracket(line, open, groups)) {
+            groups[0] = line.substr(stretch, open - stretch);
+            return true;
+        }
+    }
+    return false;
+}
+
+// "(\S+)\s*:(.+)": within a run of non-blanks, group 1 is the whole run when blanks and a ':'
+// follow, else it ends at the run's last ':' that has text after it; a run that fails fails from
+// every start inside it.
+bool MatchPipelineLine(const std::string& line, std::string& name, std::string& rest) {
+    auto hasRest = [&line](size_t from) {  // ".+" matches no line end
+        return from < line.size() && line[from] != '\r' && line[from] != '\n';
+    };
+    for (size_t run = 0; run < line.size();) {
+        if (IsBlank(line[run])) {
+            run++;
+            continue;
+        }
+        size_t runEnd = run;
+        while (runEnd < line.size() && !IsBlank(line[runEnd])) {
+            runEnd++;
+        }
+        size_t colon = runEnd;
+        while (colon < line.size() && IsBlank(line[colon])) {
+            colon++;
+        }
+        size_t nameEnd = runEnd;
+        if (colon == line.size() || line[colon] != ':' || !hasRest(colon + 1)) {
+            for (colon = runEnd - 1; colon > run && !(line[colon] == ':' && hasRest(colon + 1)); colon--) {
+            }
+            nameEnd = colon;
+        }
+        if (nameEnd > run) {
+            size_t restEnd = std::min(line.find_first_of("\r\n", colon + 1), line.size());
+            name = line.substr(run, nameEnd - run);
+            rest = line.substr(colon + 1, restEnd - colon - 1);
+            return true;
+        }
+        run = runEnd;
+    }
+    return false;
 }
 
 // Digits only, as the expressions guarantee; false when the number does not fit.
@@ -111,16 +230,16 @@ bool Config::Parse() {
 }
 
 bool Config::ParsePlugin(const std::string& line) {
-    std::smatch match;
+    std::string groups[5];  // name, thread type, thread name, delay, kind
     PluginInfo info;
-    if (!SearchLine(line, PluginExpression(), match) || !ParseDecimal(match[4], info.delay)) {
+    if (line.size() > kMaxLineLength || !MatchPluginLine(line, groups) || !ParseDecimal(groups[3], info.delay)) {
         OLOGW("%s no match plugin expression found");
         return false;
     }
-    info.name = StringUtil::TrimStr(match[1], ' ');
-    info.threadType = match[2];
-    info.threadName = match[3];
-    info.isStatic = match[5] == "static";
+    info.name = StringUtil::TrimStr(groups[0], ' ');
+    info.threadType = groups[1];
+    info.threadName = groups[2];
+    info.isStatic = groups[4] == "static";
     if (!info.threadType.empty() && info.threadType != "thread") {
         OLOGW("%s plugin %s thread type %s invalid", info.name.c_str(), info.threadType.c_str());
         return false;
@@ -140,14 +259,13 @@ bool Config::ParsePlugin(const std::string& line) {
 }
 
 bool Config::ParsePipeline(const std::string& line) {
-    std::smatch match;
-    if (!SearchLine(line, PipelineExpression(), match)) {
+    PipelineInfo info;
+    std::string plugins;
+    if (line.size() > kMaxLineLength || !MatchPipelineLine(line, info.name, plugins)) {
         OLOGW("%s Fail to match pipeline expression");
         return false;
     }
-    PipelineInfo info;
-    info.name = match[1];
-    info.plugins = SplitNames(match[2]);
+    info.plugins = SplitNames(plugins);
     for (const auto& plugin : info.plugins) {
         if (FindPlugin(plugin) == nullptr) {
             OLOGW("%s pipeline %s include undefine plugin %s", info.name.c_str(), plugin.c_str());
@@ -160,18 +278,17 @@ bool Config::ParsePipeline(const std::string& line) {
 }
 
 bool Config::ParsePipelineTrigger(const std::string& line) {
-    std::smatch match;
-    if (!SearchLine(line, PipelineExpression(), match)) {
+    std::string source, pipelineNames;
+    if (line.size() > kMaxLineLength || !MatchPipelineLine(line, source, pipelineNames)) {
         OLOGW("%s Fail to match pipeline trigger expression");
         return false;
     }
-    std::string source = match[1];
     PluginInfo* plugin = FindPlugin(source);
     if (plugin == nullptr) {
         OLOGE("%s %s not define in plugins", source.c_str());
         return false;
     }
-    std::vector<std::string> pipelines = SplitNames(match[2]);
+    std::vector<std::string> pipelines = SplitNames(pipelineNames);
     for (const auto& pipeline : pipelines) {
         if (!HasPipeline(pipeline)) {
             OLOGW("%s pipelinetriggers %s include undefine pipeline %s", source.c_str(), pipeline.c_str());

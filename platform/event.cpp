@@ -1,5 +1,6 @@
 #include "platform/event.h"
 
+#include "utils/orvane_log.h"
 #include "utils/string_util.h"
 #include "utils/time_util.h"
 
@@ -48,6 +49,25 @@ std::map<std::string, std::string> Event::GetKeyValuePairs(bool extra) const {
 
 void Event::ResetTimestamp() {
     timestamp = TimeUtil::GetTimestampUS();
+}
+
+SyncTask::SyncTask(std::string loopName, std::function<EVENT_RET()> work)
+    : loopName_(std::move(loopName)), work_(std::move(work)) {}
+
+SyncTask::~SyncTask() {
+    if (!ran_) {
+        OLOG_AS(ANDROID_LOG_ERROR, "AddEventWaitResult", "%s %s stopped before the event ran, reported as failed",
+                loopName_.c_str());
+        result_.set_value(-1);
+    }
+}
+
+void SyncTask::operator()() {
+    if (ran_) {
+        return;
+    }
+    ran_ = true;
+    result_.set_value(work_());
 }
 
 }  // namespace Orvane

@@ -69,6 +69,28 @@ private:
     const std::map<std::string, std::string>& Params(bool extra) const { return extra ? extraParams : params; }
 };
 
+// The work of a synchronous loop entry and the result that its caller waits for. It runs at most
+// once. One destroyed without having run (its loop stopped first) gives its caller -1 with one
+// error line, so that no caller waits for good and no failure needs an exception.
+class SyncTask {
+public:
+    SyncTask(std::string loopName, std::function<EVENT_RET()> work);
+    ~SyncTask();
+    SyncTask(const SyncTask&) = delete;
+    SyncTask& operator=(const SyncTask&) = delete;
+
+    // Runs the work on the calling thread and hands its result to the waiting caller.
+    void operator()();
+    // Called once, by the caller that is to wait.
+    std::future<EVENT_RET> GetResult() { return result_.get_future(); }
+
+private:
+    const std::string loopName_;
+    std::function<EVENT_RET()> work_;
+    std::promise<EVENT_RET> result_;
+    bool ran_ = false;
+};
+
 // One entry of an event loop's queue: an event for a handler, a task, or a synchronous task
 // whose caller waits for its result. Times are nanoseconds of the monotonic clock since system
 // start. Owned by the loop's queue; a copy shares event, handler and syncTask.
@@ -86,7 +108,7 @@ struct LoopEvent {
     sp<Event> event;
     sp<EventHandler> handler;
     std::function<void()> task;
-    std::shared_ptr<std::packaged_task<EVENT_RET()>> syncTask;
+    std::shared_ptr<SyncTask> syncTask;
 
     // Later entries are "less", so a max-heap keeps the earliest due one on top. Equal due
     // times are not ordered further.

@@ -14,7 +14,7 @@ void EventDispatcher::OnLoad() {
 
 EVENT_RET EventDispatcher::OnEvent(sp<Event>& event) {
     if (event == nullptr) {
-        OLOGW("%s event is null");
+        OLOGW_LIMITED("%s event is null");
         return -1;
     }
     if (event->dispatchType != kDispatchType) {
@@ -36,7 +36,7 @@ void EventDispatcher::AddListener(sp<EventListener> listener) {
         return;
     }
     {
-        std::lock_guard<std::mutex> lock(listenersLock_);
+        Mutex::Autolock lock(listenersLock_);
         if (std::find(listeners_.begin(), listeners_.end(), listener) != listeners_.end()) {
             return;
         }
@@ -46,7 +46,7 @@ void EventDispatcher::AddListener(sp<EventListener> listener) {
 }
 
 std::vector<sp<EventListener>> EventDispatcher::GetListeners() {
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     return listeners_;
 }
 

@@ -1,10 +1,10 @@
 #ifndef ORVANE_PLATFORM_EVENT_DISPATCHER_H
 #define ORVANE_PLATFORM_EVENT_DISPATCHER_H
 
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include <utils/Mutex.h>
 #include <utils/StrongPointer.h>
 
 #include "platform/event.h"
@@ -30,8 +30,8 @@ public:
     std::vector<sp<EventListener>> GetListeners();
 
 private:
-    std::mutex listenersLock_;
-    std::vector<sp<EventListener>> listeners_;
+    Mutex listenersLock_;
+    std::vector<sp<EventListener>> listeners_ GUARDED_BY(listenersLock_);
 };
 
 }  // namespace Orvane

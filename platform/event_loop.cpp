@@ -1,7 +1,8 @@
 #include "platform/event_loop.h"
 
+#include <unistd.h>
+
 #include <algorithm>
-#include <exception>
 #include <utility>
 
 #include "utils/orvane_log.h"
@@ -22,9 +23,18 @@ uint64_t Now() {
     return static_cast<uint64_t>(TimeUtil::GetNanoSecondSinceSystemStart());
 }
 
+DaemonStats::Counter* LoopCounter(DaemonStats* stats, const std::string& loop, const char* name) {
+    return stats == nullptr ? nullptr : &stats->Get("loop." + loop + "." + name);
+}
+
 }  // namespace
 
-EventLoop::EventLoop(const std::string& name) : name_(name), looper_(new Looper(false)) {}
+EventLoop::EventLoop(const std::string& name, std::shared_ptr<DaemonStats> stats)
+    : name_(name),
+      looper_(new Looper(false)),
+      stats_(std::move(stats)),
+      backlogHigh_(LoopCounter(stats_.get(), name, "backlog_high")),
+      slow_(LoopCounter(stats_.get(), name, "slow")) {}
 
 EventLoop::~EventLoop() {
     OLOGD("%s name :%s exit", name_.c_str());
@@ -51,9 +61,29 @@ void EventLoop::StopLoop() {
     if (thread_ == nullptr) {
         return;
     }
+    {
+        Mutex::Autolock lock(mutex_);
+        stopped_ = true;
+    }
     thread_->requestExit();
     looper_->wake();
     thread_->requestExitAndWait();
+    // A synchronous entry queued while the thread was ending would hold its caller for good;
+    // released outside the lock, each gives its caller a failure.
+    std::deque<LoopEvent> unrun;
+    {
+        Mutex::Autolock lock(mutex_);
+        auto sync = std::partition(queue_.begin(), queue_.end(), [](const LoopEvent& e) { return e.taskType != 1; });
+        std::move(sync, queue_.end(), std::back_inserter(unrun));
+        queue_.erase(sync, queue_.end());
+        std::make_heap(queue_.begin(), queue_.end());
+        backlog_.store(queue_.size(), std::memory_order_relaxed);
+    }
+}
+
+bool EventLoop::IsCurrentThread() const {
+    pid_t loopThread = threadId_.load(std::memory_order_relaxed);
+    return loopThread != 0 && loopThread == gettid();
 }
 
 LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
@@ -66,15 +96,27 @@ LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
     return entry;
 }
 
-uint64_t EventLoop::Enqueue(LoopEvent&& entry) {
+uint64_t EventLoop::Enqueue(LoopEvent entry) {
     uint64_t id = entry.createTime;
     {
         Mutex::Autolock lock(mutex_);
-        queue_.push_back(std::move(entry));
-        std::push_heap(queue_.begin(), queue_.end());
+        if (stopped_ && entry.taskType == 1) {
+            return id;  // `entry` is released after the lock, which releases its caller
+        }
+        PushLocked(std::move(entry));
     }
     looper_->wake();
     return id;
+}
+
+void EventLoop::PushLocked(LoopEvent&& entry) {
+    queue_.push_back(std::move(entry));
+    std::push_heap(queue_.begin(), queue_.end());
+    size_t backlog = queue_.size();
+    backlog_.store(backlog, std::memory_order_relaxed);
+    if (backlogHigh_ != nullptr) {
+        DaemonStats::RaiseTo(*backlogHigh_, backlog);
+    }
 }
 
 uint64_t EventLoop::AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds, bool repeat) {
@@ -93,19 +135,16 @@ bool EventLoop::AddEventWaitResult(sp<EventHandler> handler, sp<Event> event) {
         OLOGE("%s handler or event is nullptr");
         return false;
     }
-    LoopEvent entry = NewEntry(0, false);
-    entry.taskType = 1;
-    entry.syncTask = std::make_shared<std::packaged_task<EVENT_RET()>>(
-            [handler, event]() mutable { return handler->OnEvent(event); });
-    std::future<EVENT_RET> result = entry.syncTask->get_future();
-    Enqueue(std::move(entry));
-    try {
-        return result.get() != -1;
-    } catch (const std::exception& e) {
-        // The handler threw: its failure stays on this side.
-        OLOGE("%s %s event not handled: %s", name_.c_str(), e.what());
+    if (IsCurrentThread()) {
+        OLOGE("%s %s would wait for its own thread for good, event %u refused", name_.c_str(), event->eventId);
         return false;
     }
+    LoopEvent entry = NewEntry(0, false);
+    entry.taskType = 1;
+    entry.syncTask = std::make_shared<SyncTask>(name_, [handler, event]() mutable { return handler->OnEvent(event); });
+    std::future<EVENT_RET> result = entry.syncTask->GetResult();
+    Enqueue(std::move(entry));
+    return result.get() != -1;
 }
 
 uint64_t EventLoop::AddTask(std::function<void()> task, unsigned long delaySeconds, bool repeat) {
@@ -118,6 +157,9 @@ void EventLoop::ProcessEventLoop() {
     // An entry may hold the last reference to this loop. Then the loop is destroyed on its own
     // thread when `self` goes, and from there on only the local looper may be touched.
     sp<Looper> sleeper = looper_;
+    if (threadId_.load(std::memory_order_relaxed) == 0) {
+        threadId_.store(gettid(), std::memory_order_relaxed);
+    }
     unsigned long waitNs = kWaitForever;
     {
         // Empty while another thread destroys this loop; that thread's stop wakes the sleep.
@@ -137,6 +179,9 @@ void EventLoop::ProcessEventLoop() {
             uint64_t costUs = TimeUtil::GetTimestampUS() - startUs;
             if (costUs >= kSlowEntryUs) {
                 OLOGD("%s onevent name %s  consume time %dms", name_.c_str(), static_cast<int>(costUs / 1000));
+                if (slow_ != nullptr) {
+                    slow_->fetch_add(1, std::memory_order_relaxed);
+                }
             }
             ReEnqueueEvent(entry);
             Mutex::Autolock lock(mutex_);
@@ -161,6 +206,7 @@ bool EventLoop::FetchNextEvent(unsigned long now, unsigned long& waitNs, LoopEve
     std::pop_heap(queue_.begin(), queue_.end());
     out = std::move(queue_.back());
     queue_.pop_back();
+    backlog_.store(queue_.size(), std::memory_order_relaxed);
     current_ = &out;
     return true;
 }
@@ -169,7 +215,7 @@ void EventLoop::ProcessEvent(LoopEvent& entry) {
     switch (entry.taskType) {
         case 1:
             if (entry.syncTask == nullptr) {
-                OLOGW("%s Loop event not execute, no sync task %s", name_.c_str());
+                OLOGW_LIMITED("%s Loop event not execute, no sync task %s", name_.c_str());
                 return;
             }
             (*entry.syncTask)();
@@ -180,11 +226,11 @@ void EventLoop::ProcessEvent(LoopEvent& entry) {
             } else if (entry.handler != nullptr && entry.event != nullptr) {
                 entry.handler->OnEvent(entry.event);
             } else {
-                OLOGW("%s Loop event not execute, no task or handler %s", name_.c_str());
+                OLOGW_LIMITED("%s Loop event not execute, no task or handler %s", name_.c_str());
             }
             return;
         default:
-            OLOGW("%s unrecognized task type. %s", name_.c_str());
+            OLOGW_LIMITED("%s unrecognized task type. %s", name_.c_str());
     }
 }
 
@@ -196,8 +242,7 @@ void EventLoop::ReEnqueueEvent(LoopEvent& entry) {
     entry.enqueueTime = Now();
     entry.targetTime = entry.enqueueTime + entry.interval;
     Mutex::Autolock lock(mutex_);
-    queue_.push_back(std::move(entry));
-    std::push_heap(queue_.begin(), queue_.end());
+    PushLocked(std::move(entry));
 }
 
 }  // namespace Orvane

@@ -1,10 +1,14 @@
 #ifndef ORVANE_PLATFORM_EVENT_LOOP_H
 #define ORVANE_PLATFORM_EVENT_LOOP_H
 
+#include <sys/types.h>
+
+#include <atomic>
 #include <cstdint>
 #include <deque>
 #include <functional>
 #include <map>
+#include <memory>
 #include <string>
 
 #include <utils/Looper.h>
@@ -15,6 +19,7 @@
 
 #include "platform/event.h"
 #include "platform/event_handler.h"
+#include "utils/daemon_stats.h"
 
 namespace android {
 namespace Orvane {
@@ -48,16 +53,20 @@ public:
 // loop's own thread, which sleeps in the looper while nothing is due.
 //
 // Threads: any thread may add entries (AddEvent, AddEventWaitResult, AddTask); only the loop's
-// thread takes and runs them. `mutex` guards `queue` and `current` and is never held while an
-// entry runs; producers wake the looper after releasing it. StartLoop and StopLoop belong to
-// the loop's owner and must not race each other. Always hold a loop through sp<EventLoop>.
+// thread takes and runs them. `mutex_` guards the queue and is never held while an entry runs;
+// producers wake the looper after releasing it. StartLoop and StopLoop belong to the loop's
+// owner and must not race each other. Always hold a loop through sp<EventLoop>.
+//
+// Given statistics, the loop reports the high-water mark of its backlog as
+// "loop.<name>.backlog_high" and counts the entries that ran 301 ms or more as "loop.<name>.slow".
 class EventLoop : public RefBase {
 public:
-    explicit EventLoop(const std::string& name);
+    explicit EventLoop(const std::string& name, std::shared_ptr<DaemonStats> stats = nullptr);
     ~EventLoop() override;
 
     void StartLoop();
-    // Stops the thread and waits for it; entries still queued never run.
+    // Stops the thread and waits for it; entries still queued never run, and callers still
+    // waiting for a synchronous entry are released with a failure.
     void StopLoop();
 
     // Delivers `event` to `handler` on this loop after `delaySeconds`, again every
@@ -65,15 +74,23 @@ public:
     // handler or event.
     uint64_t AddEvent(sp<EventHandler> handler, sp<Event> event, unsigned long delaySeconds = 0, bool repeat = false);
     // Runs handler->OnEvent(event) on this loop and waits for it; false when it returned -1 or
-    // could not run. Never call it from this loop's own thread.
+    // cannot run: called on this loop's own thread, which would wait for itself for good, or
+    // on a stopped loop. Each refusal logs one error line.
     bool AddEventWaitResult(sp<EventHandler> handler, sp<Event> event);
     uint64_t AddTask(std::function<void()> task, unsigned long delaySeconds = 0, bool repeat = false);
 
     const std::string& GetName() const { return name_; }
+    // True when the caller runs on this loop's thread.
+    bool IsCurrentThread() const;
+    // The number of entries queued and not yet taken, without taking the lock.
+    size_t GetBacklog() const { return backlog_.load(std::memory_order_relaxed); }
 
 private:
     LoopEvent NewEntry(unsigned long delaySeconds, bool repeat) const;
-    uint64_t Enqueue(LoopEvent&& entry);
+    // Queues the entry and wakes the loop; a synchronous entry given to a stopped loop is dropped,
+    // which releases its caller.
+    uint64_t Enqueue(LoopEvent entry);
+    void PushLocked(LoopEvent&& entry) REQUIRES(mutex_);
     // One turn of the loop's thread: runs every due entry, then sleeps until the next is due
     // or a producer wakes it.
     void ProcessEventLoop();
@@ -84,9 +101,18 @@ private:
     const std::string name_;
     sp<ThreadImpl> thread_;
     const sp<Looper> looper_;
-    LoopEvent* current_ = nullptr;
+    // Kernel id of the loop's thread, 0 until it has run.
+    std::atomic<pid_t> threadId_{0};
+    // Keeps the counters below alive as long as this loop.
+    const std::shared_ptr<DaemonStats> stats_;
+    DaemonStats::Counter* const backlogHigh_;
+    DaemonStats::Counter* const slow_;
+    std::atomic<size_t> backlog_{0};
     Mutex mutex_;
-    std::deque<LoopEvent> queue_;
+    LoopEvent* current_ GUARDED_BY(mutex_) = nullptr;
+    std::deque<LoopEvent> queue_ GUARDED_BY(mutex_);
+    // Set by StopLoop: synchronous entries are refused from then on.
+    bool stopped_ GUARDED_BY(mutex_) = false;
     // Kept for file-descriptor events; nothing registers any yet.
     std::map<int, sp<FileEventHandler>> fileHandlers_;
 };

@@ -2,7 +2,7 @@
 
 #include <pthread.h>
 
-#include <exception>
+#include <algorithm>
 
 #include "utils/orvane_log.h"
 
@@ -16,7 +16,7 @@ EventThreadPool::~EventThreadPool() {
 }
 
 bool EventThreadPool::Start() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     if (started_ || stopped_ || count_ == 0) {
         OLOGW("%s pool %s not started: %s", name_.c_str(),
               count_ == 0 ? "no threads" : (stopped_ ? "stopped" : "already running"));
@@ -35,7 +35,7 @@ void EventThreadPool::Stop() {
     std::priority_queue<Entry, std::vector<Entry>, DelayedOrder> droppedDelayed;
     std::vector<std::thread> threads;
     {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         if (stopped_) {
             return;
         }
@@ -44,7 +44,7 @@ void EventThreadPool::Stop() {
         droppedDelayed.swap(delayed_);
         threads.swap(threads_);
     }
-    wakeup_.notify_all();
+    wakeup_.broadcast();
     for (auto& thread : threads) {
         if (thread.get_id() == std::this_thread::get_id()) {
             thread.detach();
@@ -60,7 +60,7 @@ void EventThreadPool::Stop() {
 
 bool EventThreadPool::AddTask(Task task, const std::string& taskName, uint32_t delaySeconds, int32_t priority) {
     {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         if (stopped_ || !task) {
             OLOGW("%s pool %s refuses task %s: %s", name_.c_str(), taskName.c_str(),
                   stopped_ ? "stopped" : "empty task");
@@ -74,12 +74,12 @@ bool EventThreadPool::AddTask(Task task, const std::string& taskName, uint32_t d
             delayed_.push(std::move(entry));
         }
     }
-    wakeup_.notify_one();
+    wakeup_.signal();
     return true;
 }
 
 size_t EventThreadPool::GetPendingCount() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     return ready_.size() + delayed_.size();
 }
 
@@ -93,28 +93,26 @@ void EventThreadPool::PromoteDueLocked(Clock::time_point now) {
 
 void EventThreadPool::WorkerLoop() {
     pthread_setname_np(pthread_self(), name_.substr(0, 15).c_str());
-    std::unique_lock<std::mutex> lock(mutex_);
+    mutex_.lock();
     while (!stopped_) {
         PromoteDueLocked(Clock::now());
         if (!ready_.empty()) {
             auto node = ready_.extract(ready_.begin());
-            lock.unlock();
-            try {
-                node.value().task();
-            } catch (const std::exception& e) {
-                OLOGE("%s pool %s task %s failed: %s", name_.c_str(), node.value().name.c_str(), e.what());
-            }
+            mutex_.unlock();
+            node.value().task();
             node = {};  // release the task's captures before taking the lock again
-            lock.lock();
+            mutex_.lock();
             continue;
         }
         if (delayed_.empty()) {
-            wakeup_.wait(lock);
+            wakeup_.wait(mutex_);
         } else {
-            Clock::time_point due = delayed_.top().due;  // the heap may change while waiting
-            wakeup_.wait_until(lock, due);
+            // Measured now: the heap may change while waiting.
+            Clock::duration wait = delayed_.top().due - Clock::now();
+            wakeup_.waitRelative(mutex_, std::max<nsecs_t>(0, std::chrono::nanoseconds(wait).count()));
         }
     }
+    mutex_.unlock();
 }
 
 }  // namespace Orvane

@@ -2,16 +2,16 @@
 #define ORVANE_PLATFORM_EVENT_THREAD_POOL_H
 
 #include <chrono>
-#include <condition_variable>
 #include <cstdint>
 #include <functional>
-#include <mutex>
 #include <queue>
 #include <set>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include <utils/Condition.h>
+#include <utils/Mutex.h>
 #include <utils/RefBase.h>
 
 namespace android {
@@ -72,19 +72,19 @@ private:
     };
 
     void WorkerLoop();
-    // Moves every delayed entry that has fallen due into the ready set. Under `mutex_`.
-    void PromoteDueLocked(Clock::time_point now);
+    // Moves every delayed entry that has fallen due into the ready set.
+    void PromoteDueLocked(Clock::time_point now) REQUIRES(mutex_);
 
     const size_t count_;
     const std::string name_;
-    std::mutex mutex_;
-    std::condition_variable wakeup_;
-    bool started_ = false;
-    bool stopped_ = false;
-    uint64_t nextSequence_ = 0;
-    std::set<Entry, ReadyOrder> ready_;
-    std::priority_queue<Entry, std::vector<Entry>, DelayedOrder> delayed_;
-    std::vector<std::thread> threads_;
+    Mutex mutex_;
+    Condition wakeup_;
+    bool started_ GUARDED_BY(mutex_) = false;
+    bool stopped_ GUARDED_BY(mutex_) = false;
+    uint64_t nextSequence_ GUARDED_BY(mutex_) = 0;
+    std::set<Entry, ReadyOrder> ready_ GUARDED_BY(mutex_);
+    std::priority_queue<Entry, std::vector<Entry>, DelayedOrder> delayed_ GUARDED_BY(mutex_);
+    std::vector<std::thread> threads_ GUARDED_BY(mutex_);
 };
 
 }  // namespace Orvane

@@ -17,12 +17,24 @@ extern "C" const char* __tsan_default_suppressions() {
 }
 #endif
 
+namespace {
+
+// A write to a pipe whose reader is gone (a dump caller that left) then fails with EPIPE instead
+// of ending the daemon. A handler rather than SIG_IGN, so that the commands it runs start with
+// the default action, as they expect.
+void IgnoreBrokenPipe(int) {}
+
+}  // namespace
+
 int main(int argc, char** argv) {
     // Every thread inherits this mask, so the command runner alone collects its children.
     sigset_t childSignal;
     sigemptyset(&childSignal);
     sigaddset(&childSignal, SIGCHLD);
     pthread_sigmask(SIG_BLOCK, &childSignal, nullptr);
+    struct sigaction brokenPipe = {};
+    brokenPipe.sa_handler = IgnoreBrokenPipe;
+    sigaction(SIGPIPE, &brokenPipe, nullptr);
 
     PluginPlatform& platform = PluginPlatform::GetInstance();
     if (platform.ParseArgs(argc, argv) != 0) {
@@ -35,6 +47,9 @@ int main(int argc, char** argv) {
     }
     // Serves the companion application on this thread for the rest of the process's life.
     sp<OrvaneService> service = new OrvaneService(&platform);
-    service->StartService();
+    if (!service->StartService()) {
+        OLOGE("%s start service failed");
+        return -1;
+    }
     return 0;
 }

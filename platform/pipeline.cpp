@@ -1,5 +1,6 @@
 #include "platform/pipeline.h"
 
+#include "platform/plugin_context.h"
 #include "utils/orvane_log.h"
 #include "utils/trace.h"
 
@@ -23,7 +24,21 @@ std::vector<sp<Plugin>> WithoutEmpty(const std::string& name, const std::vector<
 }  // namespace
 
 Pipeline::Pipeline(const std::string& name, const std::vector<sp<Plugin>>& plugins)
-    : name_(name), plugins_(WithoutEmpty(name, plugins)), listeners_(std::make_shared<const ListenerSet>()) {}
+    : name_(name), plugins_(WithoutEmpty(name, plugins)), listeners_(std::make_shared<const ListenerSet>()) {
+    PluginContext* context = plugins_.empty() ? nullptr : plugins_.front()->GetPluginContext();
+    if (context != nullptr) {
+        DaemonStats& stats = context->GetStats();
+        published_ = &stats.Get("pipeline." + name_ + ".published");
+        refused_ = &stats.Get("pipeline." + name_ + ".refused");
+        backlogHigh_ = &stats.Get("pipeline." + name_ + ".backlog_high");
+    }
+}
+
+void Pipeline::CountRefused() {
+    if (refused_ != nullptr) {
+        refused_->fetch_add(1, std::memory_order_relaxed);
+    }
+}
 
 bool Pipeline::CanProcessEvent(sp<Event> event) {
     if (plugins_.empty()) {
@@ -37,6 +52,13 @@ void Pipeline::ProcessPipeline(sp<Event> event, unsigned int index) {
     if (index >= plugins_.size()) {
         OLOGE("%s index over plugins size");
         return;
+    }
+    if (index == 0) {
+        uint64_t backlog = backlog_.fetch_add(1, std::memory_order_relaxed) + 1;
+        if (published_ != nullptr) {
+            published_->fetch_add(1, std::memory_order_relaxed);
+            DaemonStats::RaiseTo(*backlogHigh_, backlog);
+        }
     }
     // Plain pointers suffice: this pipeline holds its plugins, and each keeps its loops alive.
     EventLoop* looper = plugins_[index]->CurrentLooper();
@@ -73,6 +95,7 @@ void Pipeline::ProcessEvent(sp<Event> event, unsigned int index) {
         ret = plugin->OnEvent(event);
     }
     if (ret == -1) {
+        Leave();
         return;
     }
     if (index + 1 == plugins_.size()) {
@@ -85,18 +108,21 @@ void Pipeline::ProcessEvent(sp<Event> event, unsigned int index) {
                 listener->OnEvent(event);
             }
         }
+        Leave();
         return;
     }
-    if (ret != 1) {
-        ProcessPipeline(std::move(event), index + 1);
+    if (ret == 1) {
+        Leave();
+        return;
     }
+    ProcessPipeline(std::move(event), index + 1);
 }
 
 void Pipeline::RegisterPluginListener(sp<Plugin> listener) {
     if (listener == nullptr) {
         return;
     }
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     if (listeners_->count(listener) > 0) {
         return;
     }
@@ -106,7 +132,7 @@ void Pipeline::RegisterPluginListener(sp<Plugin> listener) {
 }
 
 void Pipeline::ReleaseListeners() {
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     listeners_ = std::make_shared<const ListenerSet>();
 }
 
@@ -115,7 +141,7 @@ std::set<sp<Plugin>> Pipeline::GetListeners() const {
 }
 
 std::shared_ptr<const Pipeline::ListenerSet> Pipeline::CurrentListeners() const {
-    std::lock_guard<std::mutex> lock(listenersLock_);
+    Mutex::Autolock lock(listenersLock_);
     return listeners_;
 }
 

@@ -21,7 +21,7 @@ void Plugin::SetLooper(sp<EventLoop> looper) {
     if (looper == nullptr) {
         return;
     }
-    std::lock_guard<std::mutex> lock(looperLock_);
+    Mutex::Autolock lock(looperLock_);
     if (looper.get() != looper_.load()) {
         loopers_.push_back(looper);
         looper_.store(looper.get());
@@ -48,26 +48,35 @@ bool EventSource::PublishPipelineEvent(sp<Event> event) {
         return false;
     }
     for (const auto& pipeline : pipelines_) {
-        if (pipeline != nullptr && pipeline->CanProcessEvent(event)) {
+        if (pipeline->CanProcessEvent(event)) {
             pipeline->ProcessPipeline(event, 0);
             return true;
         }
+        pipeline->CountRefused();
     }
     return false;
 }
 
+uint64_t EventSource::Backlog() const {
+    uint64_t backlog = 0;
+    for (const auto& pipeline : pipelines_) {
+        backlog += pipeline->Backlog();
+    }
+    return backlog;
+}
+
 void EventListener::AddListenerInfo(uint32_t eventType, uint32_t beginId, uint32_t endId) {
-    std::lock_guard<std::mutex> lock(infoLock_);
+    Mutex::Autolock lock(infoLock_);
     listenerInfo_.push_back({eventType, beginId, endId});
 }
 
 std::vector<EventListener::ListenerInfo> EventListener::GetListenerInfo() const {
-    std::lock_guard<std::mutex> lock(infoLock_);
+    Mutex::Autolock lock(infoLock_);
     return listenerInfo_;
 }
 
 bool EventListener::IsInterested(const Event& event) const {
-    std::lock_guard<std::mutex> lock(infoLock_);
+    Mutex::Autolock lock(infoLock_);
     for (const auto& info : listenerInfo_) {
         if (info.eventType == event.eventType && info.beginId <= event.eventId && event.eventId <= info.endId) {
             return true;

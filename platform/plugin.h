@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include <utils/Mutex.h>
 #include <utils/RefBase.h>
 #include <utils/StrongPointer.h>
 
@@ -63,8 +64,8 @@ private:
     // lock, and `loopers_` (guarded by `looperLock_`) keeps every loop ever set alive until the
     // plugin goes, so that a pointer just read is never freed under its reader.
     std::atomic<EventLoop*> looper_{nullptr};
-    std::mutex looperLock_;
-    std::vector<sp<EventLoop>> loopers_;
+    Mutex looperLock_;
+    std::vector<sp<EventLoop>> loopers_ GUARDED_BY(looperLock_);
     PluginContext* context_ = nullptr;
     std::once_flag contextOnce_;
 };
@@ -83,6 +84,8 @@ public:
     void AddPipeline(const std::string& name, sp<Pipeline> pipeline);
     // False for an empty event or when no pipeline accepts it.
     bool PublishPipelineEvent(sp<Event> event);
+    // Events in this source's pipelines that have not come through yet (Pipeline::Backlog).
+    uint64_t Backlog() const;
 
 private:
     std::vector<sp<Pipeline>> pipelines_;
@@ -118,8 +121,8 @@ public:
 
 private:
     const std::string listenerName_;
-    mutable std::mutex infoLock_;
-    std::vector<ListenerInfo> listenerInfo_;
+    mutable Mutex infoLock_;
+    std::vector<ListenerInfo> listenerInfo_ GUARDED_BY(infoLock_);
 };
 
 }  // namespace Orvane

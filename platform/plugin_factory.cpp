@@ -1,7 +1,8 @@
 #include "platform/plugin_factory.h"
 
 #include <map>
-#include <mutex>
+
+#include <utils/Mutex.h>
 
 #include "utils/orvane_log.h"
 
@@ -11,8 +12,8 @@ namespace {
 
 // Registrations come from static initialisers of other files: the map is created on first use.
 struct Registry {
-    std::mutex mutex;
-    std::map<std::string, PluginFactory::RegisterBase*> constructors;
+    Mutex mutex;
+    std::map<std::string, PluginFactory::RegisterBase*> constructors GUARDED_BY(mutex);
 };
 
 Registry& GetRegistry() {
@@ -24,7 +25,7 @@ Registry& GetRegistry() {
 
 bool PluginFactory::RegisterPlugin(const std::string& name, RegisterBase* registration) {
     Registry& registry = GetRegistry();
-    std::lock_guard<std::mutex> lock(registry.mutex);
+    Mutex::Autolock lock(registry.mutex);
     if (name.empty() || registration == nullptr || !registry.constructors.emplace(name, registration).second) {
         OLOGW("%s plugin %s not registered: empty or already registered", name.c_str());
         return false;
@@ -36,7 +37,7 @@ sp<Plugin> PluginFactory::CreatePlugin(const std::string& name) {
     RegisterBase* registration = nullptr;
     {
         Registry& registry = GetRegistry();
-        std::lock_guard<std::mutex> lock(registry.mutex);
+        Mutex::Autolock lock(registry.mutex);
         auto it = registry.constructors.find(name);
         if (it == registry.constructors.end()) {
             return nullptr;
@@ -48,7 +49,7 @@ sp<Plugin> PluginFactory::CreatePlugin(const std::string& name) {
 
 std::vector<std::string> PluginFactory::GetRegisteredNames() {
     Registry& registry = GetRegistry();
-    std::lock_guard<std::mutex> lock(registry.mutex);
+    Mutex::Autolock lock(registry.mutex);
     std::vector<std::string> names;
     for (const auto& entry : registry.constructors) {
         names.push_back(entry.first);

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -27,6 +28,9 @@ constexpr const char* kRegionProperty = "ro.quor.build.region";
 // The region that the configuration folder's named file is written for.
 constexpr const char* kSupportedRegion = "CN";
 constexpr mode_t kDirMode = 0775;
+// The loop of a delayed event source configured without one. A configured loop name never holds
+// a ':', so the loop is the source's alone.
+constexpr const char* kOwnSourceLoopSuffix = ":source";
 
 std::atomic<PluginPlatform*> g_platform{nullptr};
 
@@ -70,7 +74,7 @@ PluginPlatform::~PluginPlatform() {
         loop.second->StopLoop();
     }
     {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         for (const auto& pipeline : pipelines_) {
             pipeline.second->ReleaseListeners();
         }
@@ -80,9 +84,6 @@ PluginPlatform::~PluginPlatform() {
     }
     dispatcher_ = nullptr;
     workLoop_ = nullptr;
-    if (pidFd_ >= 0) {
-        close(pidFd_);
-    }
 }
 
 int PluginPlatform::ParseArgs(int argc, char** argv) {
@@ -97,7 +98,7 @@ int PluginPlatform::ParseArgs(int argc, char** argv) {
         } else if (option == "-workDir") {
             workDir_ = NormalizeDir(value);
         } else if (option == "-cloudCfgDir") {
-            cloudConfigDir_ = NormalizeDir(value);
+            SetCloudConfigFolder(value);
         } else if (option == "-devList") {
             devList_ = value;
             ParseDevList();
@@ -163,10 +164,17 @@ void PluginPlatform::ForceCreateDirs() {
 
 bool PluginPlatform::IsExist() {
     std::string path = workDir_ + kPidFileName;
-    // Close-on-exec: children of the daemon must not keep the lock after it is gone.
-    int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0640);
+    // Close-on-exec: children of the daemon must not keep the lock after it is gone. No links:
+    // whoever could plant one would have the daemon truncate and rewrite the file it names.
+    android::base::unique_fd fd(open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
     if (fd < 0) {
-        OLOGE("%s open %s failed, err:%d, %s", path.c_str(), errno, strerror(errno));
+        OLOGE("%s open %s failed, err:%d, %s", path.c_str(), errno,
+              errno == ELOOP ? "it is a symbolic link, not followed" : strerror(errno));
+        return true;
+    }
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || st.st_nlink != 1) {
+        OLOGE("%s %s is not a regular file of one link, refused", path.c_str());
         return true;
     }
     // The kernel drops the lock with its holder, so a marker left by a killed daemon is free.
@@ -175,7 +183,6 @@ bool PluginPlatform::IsExist() {
         char holder[32] = {0};
         ssize_t size = pread(fd, holder, sizeof(holder) - 1, 0);
         holder[size > 0 ? size : 0] = '\0';
-        close(fd);
         OLOGE("%s orvane already running, pid %s holds %s, err:%d", StringUtil::TrimStr(holder, '\n').c_str(),
               path.c_str(), err);
         return true;
@@ -184,7 +191,7 @@ bool PluginPlatform::IsExist() {
     if (ftruncate(fd, 0) != 0 || pwrite(fd, pid.data(), pid.size(), 0) != static_cast<ssize_t>(pid.size())) {
         OLOGW("%s write pid to %s failed, err:%d, %s", path.c_str(), errno, strerror(errno));
     }
-    pidFd_ = fd;
+    pidFd_ = std::move(fd);
     return false;
 }
 
@@ -194,7 +201,7 @@ void PluginPlatform::StartDispatchQueue() {
     dispatcher_->SetLooper(GetLooperByName("qx_unorder"));
     dispatcher_->OnLoad();
     if (workLoop_ == nullptr) {
-        workLoop_ = new EventLoop("plat_shared");
+        workLoop_ = new EventLoop("plat_shared", stats_);
         workLoop_->StartLoop();
     }
     PlatCtxGbl::NewInstance(this);
@@ -266,7 +273,7 @@ void PluginPlatform::ConstructPlugin(const Config::PluginInfo& info) {
     plugin->SetName(info.name);
     plugin->SetPluginContext(this);
     if (plugin->PreToLoad()) {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         plugins_[info.name] = plugin;
     }
 }
@@ -275,6 +282,11 @@ void PluginPlatform::LoadPlugin(const Config::PluginInfo& info) {
     sp<Plugin> plugin = FindPlugin(info.name);
     if (plugin == nullptr) {
         OLOGW("%s plugin %s not constructed", info.name.c_str());
+        return;
+    }
+    // A delayed plugin whose delay ended before the start-up's pass came to it is met twice.
+    if (!ClaimLoad(info.name)) {
+        OLOGD("%s plugin %s already loaded", info.name.c_str());
         return;
     }
     if (info.threadType == "thread") {
@@ -294,7 +306,15 @@ void PluginPlatform::LoadPlugin(const Config::PluginInfo& info) {
         for (const auto& name : info.pipelines) {
             source->AddPipeline(name, FindPipeline(name));
         }
-        StartEventSource(source);
+        sp<EventLoop> fallback;
+        if (info.delay >= 1 && source->GetLooper() == nullptr) {
+            // Its start is its blocking read loop: in place it would hold for good the thread
+            // that loaded it, the shared work loop (every later delayed plugin and shared task)
+            // or the main thread (the rest of start-up and the service).
+            fallback = GetLooperByName(info.name + kOwnSourceLoopSuffix);
+            OLOGW("%s delayed event source %s has no loop, given one of its own", info.name.c_str());
+        }
+        StartEventSource(source, fallback);
     }
     OLOGI("%s plugin %s isEventSource=%d, loadtime:%lu", info.name.c_str(), info.isEventSource ? 1 : 0,
           static_cast<unsigned long>(TimeUtil::GetTimestampUS() - start));
@@ -319,12 +339,15 @@ void PluginPlatform::ConstructPipeline(const Config::PipelineInfo& info) {
         plugins.push_back(plugin);
     }
     sp<Pipeline> pipeline = new Pipeline(info.name, plugins);
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     pipelines_[info.name] = pipeline;
 }
 
-void PluginPlatform::StartEventSource(sp<EventSource> source) {
+void PluginPlatform::StartEventSource(sp<EventSource> source, sp<EventLoop> fallback) {
     sp<EventLoop> looper = source->GetLooper();
+    if (looper == nullptr) {
+        looper = fallback;
+    }
     if (looper != nullptr) {
         OLOGI("%s Start event source[%s] in thead[%s]", source->GetName().c_str(), looper->GetName().c_str());
         std::shared_future<void> mayStart = sourcesMayStart_;
@@ -352,12 +375,12 @@ void PluginPlatform::NotifyPlatformReady() {
 }
 
 std::string PluginPlatform::GetCloudConfigDir() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     return cloudConfigDir_;
 }
 
 void PluginPlatform::SetCloudConfigFolder(const std::string& folder) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     cloudConfigDir_ = NormalizeDir(folder);
 }
 
@@ -366,12 +389,12 @@ sp<EventLoop> PluginPlatform::GetLooperByName(const std::string& name) {
         OLOGW("%s a loop needs a name");
         return nullptr;
     }
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     auto it = loops_.find(name);
     if (it != loops_.end()) {
         return it->second;
     }
-    sp<EventLoop> loop = new EventLoop(name);
+    sp<EventLoop> loop = new EventLoop(name, stats_);
     loop->StartLoop();
     OLOGI("%s create event looper name %s", name.c_str());
     loops_[name] = loop;
@@ -389,7 +412,7 @@ bool PluginPlatform::SetSysProperity(const std::string& key, const std::string& 
 bool PluginPlatform::PostUnorderedEvent(sp<Event> event) {
     sp<EventLoop> looper = dispatcher_ == nullptr ? nullptr : dispatcher_->GetLooper();
     if (looper == nullptr) {
-        OLOGW("%s dispatcher not started, event dropped");
+        OLOGW_LIMITED("%s dispatcher not started, event dropped");
         return false;
     }
     return looper->AddEvent(dispatcher_, event, 0, false) != UINT64_MAX;
@@ -406,10 +429,15 @@ void PluginPlatform::RegisterUnorderedEventListener(sp<EventListener> listener) 
 bool PluginPlatform::PostSyncEventToTarget(const std::string& pluginName, sp<Event> event) {
     sp<Plugin> plugin = FindPlugin(pluginName);
     if (plugin == nullptr || event == nullptr) {
-        OLOGW("%s plugin %s not found or event is null", pluginName.c_str());
+        OLOGW_LIMITED("%s plugin %s not found or event is null", pluginName.c_str());
         return false;
     }
     sp<EventLoop> looper = plugin->GetLooper();
+    if (looper != nullptr && looper->IsCurrentThread()) {
+        OLOGE("%s plugin %s runs on %s, the caller's own loop, which would wait for itself for good: event %u refused",
+              pluginName.c_str(), looper->GetName().c_str(), event->eventId);
+        return false;
+    }
     if (looper != nullptr) {
         return looper->AddEventWaitResult(plugin, event);
     }
@@ -419,7 +447,7 @@ bool PluginPlatform::PostSyncEventToTarget(const std::string& pluginName, sp<Eve
 bool PluginPlatform::PostAsyncEventToTarget(const std::string& pluginName, sp<Event> event) {
     sp<Plugin> plugin = FindPlugin(pluginName);
     if (plugin == nullptr || event == nullptr) {
-        OLOGW("%s plugin %s not found or event is null", pluginName.c_str());
+        OLOGW_LIMITED("%s plugin %s not found or event is null", pluginName.c_str());
         return false;
     }
     sp<EventLoop> looper = plugin->GetLooper();
@@ -433,7 +461,7 @@ bool PluginPlatform::PostAsyncEventToTarget(const std::string& pluginName, sp<Ev
 bool PluginPlatform::InsertEventToPipeline(const std::string& pipelineName, sp<Event> event) {
     sp<Pipeline> pipeline = FindPipeline(pipelineName);
     if (pipeline == nullptr || event == nullptr) {
-        OLOGW("%s pipeline %s not found or event is null", pipelineName.c_str());
+        OLOGW_LIMITED("%s pipeline %s not found or event is null", pipelineName.c_str());
         return false;
     }
     pipeline->ProcessPipeline(event, 0);
@@ -451,28 +479,33 @@ bool PluginPlatform::RegisterPipelineListener(const std::string& pipelineName, s
 }
 
 std::map<std::string, sp<Plugin>> PluginPlatform::GetPlugins() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     return plugins_;
 }
 
 std::map<std::string, sp<Pipeline>> PluginPlatform::GetPipelines() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     return pipelines_;
 }
 
 std::map<std::string, sp<EventLoop>> PluginPlatform::GetLoops() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     return loops_;
 }
 
 sp<Plugin> PluginPlatform::FindPlugin(const std::string& name) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     auto it = plugins_.find(name);
     return it == plugins_.end() ? nullptr : it->second;
 }
 
+bool PluginPlatform::ClaimLoad(const std::string& name) {
+    Mutex::Autolock lock(mutex_);
+    return loadedPlugins_.insert(name).second;
+}
+
 sp<Pipeline> PluginPlatform::FindPipeline(const std::string& name) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     auto it = pipelines_.find(name);
     return it == pipelines_.end() ? nullptr : it->second;
 }

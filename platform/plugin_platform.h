@@ -4,9 +4,12 @@
 #include <atomic>
 #include <future>
 #include <map>
-#include <mutex>
+#include <memory>
+#include <set>
 #include <string>
 
+#include <android-base/unique_fd.h>
+#include <utils/Mutex.h>
 #include <utils/StrongPointer.h>
 
 #include "platform/config.h"
@@ -25,10 +28,11 @@ namespace Orvane {
 // announces that it is ready. It is the context of every plugin.
 //
 // Threads: ParseArgs and StartPlatform run on the main thread before anything else uses the
-// platform; the folders and options they set are read-only afterwards, except the cloud
-// configuration folder. `mutex_` guards that folder and the plugin, pipeline and loop tables
-// (delayed plugins are added later on the shared work loop); callers get copies of the
-// pointers and call plugins outside the lock.
+// platform; the folders and options they set, the shared work loop and the dispatcher are
+// read-only afterwards, except the cloud configuration folder. `mutex_` guards that folder and
+// the plugin, pipeline and loop tables (delayed plugins are added later on the shared work
+// loop); callers get copies of the pointers and call plugins outside the lock. Every loop that
+// the platform creates reports to its statistics.
 class PluginPlatform : public PluginContext {
 public:
     // The daemon's one platform, created on first use and never destroyed.
@@ -53,7 +57,8 @@ public:
     // Runs on the shared work loop once the plugin's delay has passed.
     void LoadDelayedPlugin(const Config::PluginInfo& info);
     void ConstructPipeline(const Config::PipelineInfo& info);
-    void StartEventSource(sp<EventSource> source);
+    // Starts the source on its loop, else on `fallback`, else on the calling thread.
+    void StartEventSource(sp<EventSource> source, sp<EventLoop> fallback = nullptr);
     void NotifyPlatformReady();
 
     // PluginContext.
@@ -73,7 +78,7 @@ public:
     bool InsertEventToPipeline(const std::string& pipelineName, sp<Event> event) override;
     bool RegisterPipelineListener(const std::string& pipelineName, sp<Plugin> listener) override;
     void SetCloudConfigFolder(const std::string& folder) override;
-    DaemonStats& GetStats() override { return stats_; }
+    DaemonStats& GetStats() override { return *stats_; }
 
     // Read access for dumps: copies, safe at any time.
     std::map<std::string, sp<Plugin>> GetPlugins();
@@ -93,21 +98,25 @@ private:
     void ParseDevList();
     sp<Plugin> FindPlugin(const std::string& name);
     sp<Pipeline> FindPipeline(const std::string& name);
+    // True for the first caller only: a plugin is loaded once, by the start-up or by its delay.
+    bool ClaimLoad(const std::string& name);
 
     std::atomic<bool> isReady_{false};
-    DaemonStats stats_;
+    // Shared with the loops, which may outlive the platform in a plugin's hands.
+    const std::shared_ptr<DaemonStats> stats_ = std::make_shared<DaemonStats>();
     std::string configDir_ = "/system/etc/orvane/";
-    std::string cloudConfigDir_ = "/data/quorlog/orvane/config/";
     std::string workDir_ = "/data/quorlog/orvane/";
     std::string configName_ = "plugin_config";
     std::string devList_;
     std::string region_;
     std::map<std::string, std::string> devicePaths_;
 
-    std::mutex mutex_;
-    std::map<std::string, sp<Plugin>> plugins_;
-    std::map<std::string, sp<Pipeline>> pipelines_;
-    std::map<std::string, sp<EventLoop>> loops_;
+    Mutex mutex_;
+    std::string cloudConfigDir_ GUARDED_BY(mutex_) = "/data/quorlog/orvane/config/";
+    std::map<std::string, sp<Plugin>> plugins_ GUARDED_BY(mutex_);
+    std::map<std::string, sp<Pipeline>> pipelines_ GUARDED_BY(mutex_);
+    std::map<std::string, sp<EventLoop>> loops_ GUARDED_BY(mutex_);
+    std::set<std::string> loadedPlugins_ GUARDED_BY(mutex_);
     sp<EventLoop> workLoop_;
     sp<EventDispatcher> dispatcher_;
     // Ready once every start-up plugin is loaded. Event sources wait for it on their loops
@@ -115,7 +124,7 @@ private:
     // Set by LoadPlugins on the main thread.
     std::shared_future<void> sourcesMayStart_;
     // Holds the exclusive lock on "orvane.pid" for the platform's life.
-    int pidFd_ = -1;
+    android::base::unique_fd pidFd_;
 };
 
 // Reaches the running platform from code that has no context pointer. Safe from any thread.

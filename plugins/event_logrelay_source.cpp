@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include "platform/pipeline.h"
-#include "platform/plugin_context.h"
 #include "platform/plugin_factory.h"
 #include "utils/orvane_log.h"
 
@@ -16,22 +15,18 @@ namespace Orvane {
 ORVANE_REGISTER_PLUGIN(EventLogrelaySource);
 
 namespace {
+
+using android::base::unique_fd;
+
 const char* const kDeviceName = "qx_exception_log";
 constexpr uint32_t kExceptionEventId = 902902;
 constexpr int kMaxEvents = 64;
 // The driver's records are read in pieces of at most this many bytes, each its own event.
 constexpr size_t kMaxRead = 1023;
-// Pause after a failed wait or read: a node that vanished reports an error at once, and the
-// loop must not spin on it.
-constexpr useconds_t kIdlePauseUs = 100 * 1000;
-}  // namespace
+// Pause after a failed wait or read that did not lose the node, so that it is not spun on.
+constexpr std::chrono::milliseconds kIdlePause{100};
 
-EventLogrelaySource::~EventLogrelaySource() {
-    // The epoll instance outlives OnUnload because the loop may still be waiting on it.
-    if (epollFd_ != -1) {
-        close(epollFd_);
-    }
-}
+}  // namespace
 
 void EventLogrelaySource::OnLoad() {
     OLOGD("%s Load logrelay source ");
@@ -40,14 +35,14 @@ void EventLogrelaySource::OnLoad() {
 }
 
 void EventLogrelaySource::OnUnload() {
-    stopping_ = true;
-    std::lock_guard<std::mutex> guard(monitorLock_);
+    DeviceSource::OnUnload();
+    Mutex::Autolock guard(monitorLock_);
     if (monitor_ == nullptr) {
         return;
     }
-    monitor_->unregisterExceptionLogMonitor(epollFd_, deviceFd_);
-    // A loop still running owns the descriptor until it returns: closing it under the loop's
-    // feet would let the next file opened take its number and be read instead.
+    monitor_->unregisterExceptionLogMonitor(epollFd_.get(), deviceFd_.get());
+    // A loop still running owns the descriptors until it returns: closing them under the loop's
+    // feet would let the next file opened take a number and be read instead.
     if (!looping_) {
         ReleaseDevice();
     }
@@ -55,33 +50,32 @@ void EventLogrelaySource::OnUnload() {
 
 void EventLogrelaySource::ReleaseDevice() {
     monitor_->destoryExceptionLogFd(deviceFd_);
-    deviceFd_ = -1;
+    epollFd_.reset();
     monitor_.reset();
 }
 
 void EventLogrelaySource::StartEventSource() {
     OLOGD("%s Logrelay start init");
-    PluginContext* context = GetPluginContext();
-    std::string path = context != nullptr ? context->GetDevicePath(kDeviceName, android::FileMonitor::kExceptionLogPath)
-                                          : android::FileMonitor::kExceptionLogPath;
+    // The node's absence at start means a kernel without the channel: nothing to wait for.
+    path_ = DevicePath(kDeviceName, android::FileMonitor::kExceptionLogPath);
     {
-        std::lock_guard<std::mutex> guard(monitorLock_);
+        Mutex::Autolock guard(monitorLock_);
         monitor_ = std::make_unique<android::FileMonitor>();
-        int fd = monitor_->openExceptionLogFd(path);
-        if (fd < 0) {
+        unique_fd fd = monitor_->openExceptionLogFd(path_);
+        if (!fd.ok()) {
             return;
         }
-        int epfd = monitor_->registerExceptionLogMonitor(fd);
-        if (epfd < 0) {
+        unique_fd epfd = monitor_->registerExceptionLogMonitor(fd);
+        if (!epfd.ok()) {
             return;
         }
-        deviceFd_ = fd;
-        epollFd_ = epfd;
+        deviceFd_ = std::move(fd);
+        epollFd_ = std::move(epfd);
         looping_ = true;
     }
     threadLoop();
     // The loop returns only once unloading has begun.
-    std::lock_guard<std::mutex> guard(monitorLock_);
+    Mutex::Autolock guard(monitorLock_);
     looping_ = false;
     ReleaseDevice();
 }
@@ -90,33 +84,72 @@ int EventLogrelaySource::threadLoop() {
     OLOGD("%s LogRelay start loop");
     struct epoll_event events[kMaxEvents];
     char buffer[kMaxRead];
+    int epfd;
+    int fd;
+    {
+        Mutex::Autolock guard(monitorLock_);
+        epfd = epollFd_.get();
+        fd = deviceFd_.get();
+    }
     for (;;) {
-        if (epoll_wait(epollFd_, events, kMaxEvents, -1) < 0) {
+        if (epoll_wait(epfd, events, kMaxEvents, -1) < 0) {
             int error = errno;
             if (error != EINTR) {
-                OLOGE("%s epoll_wait: %s", strerror(error));
+                OLOGE_LIMITED("%s epoll_wait: %s", strerror(error));
             }
-            if (stopping_) {
+            if (Stopping()) {
                 return 0;
             }
             if (error != EINTR) {
-                usleep(kIdlePauseUs);
+                Pause(kIdlePause);
             }
             continue;
         }
-        ssize_t length = read(deviceFd_, buffer, kMaxRead);
+        if (!WaitForRoom()) {
+            return 0;
+        }
+        ssize_t length = read(fd, buffer, kMaxRead);
+        int error = errno;
         if (length < 1) {
-            if (stopping_) {
+            if (Stopping()) {
                 return 0;
             }
-            usleep(kIdlePauseUs);
+            if (length < 0 && IsLoss(error)) {
+                if (!ReopenDevice(error, epfd, fd)) {
+                    return 0;
+                }
+            } else {
+                Pause(kIdlePause);
+            }
             continue;
         }
+        CountRead();
         ParseEvent(std::string(buffer, static_cast<size_t>(length)));
-        if (stopping_) {
+        if (Stopping()) {
             return 0;
         }
     }
+}
+
+bool EventLogrelaySource::ReopenDevice(int error, int& epfd, int& fd) {
+    unique_fd epoll;
+    unique_fd device = Reopen(path_, error, [this, &epoll] {
+        unique_fd node = android::FileMonitor::OpenNode(path_);
+        if (node.ok()) {
+            Mutex::Autolock guard(monitorLock_);
+            epoll = monitor_->registerExceptionLogMonitor(node);
+        }
+        return node;
+    });
+    if (!device.ok()) {
+        return false;
+    }
+    Mutex::Autolock guard(monitorLock_);
+    epfd = epoll.get();
+    fd = device.get();
+    epollFd_ = std::move(epoll);
+    deviceFd_ = std::move(device);
+    return true;
 }
 
 void EventLogrelaySource::ParseEvent(const std::string& record) {

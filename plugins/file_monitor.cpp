@@ -9,39 +9,44 @@
 
 namespace android {
 
+using android::base::unique_fd;
+
 namespace {
 constexpr int kEpollSizeHint = 64;
 }  // namespace
 
-int FileMonitor::openExceptionLogFd(const std::string& path) {
+unique_fd FileMonitor::OpenNode(const std::string& path) {
     int fd;
     do {
         fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
     } while (fd < 0 && errno == EINTR);
-    if (fd < 0) {
+    return unique_fd(fd);
+}
+
+unique_fd FileMonitor::openExceptionLogFd(const std::string& path) {
+    unique_fd fd = OpenNode(path);
+    if (!fd.ok()) {
         OLOGE("%s No kernel exception log monitor support (errno=%d)", errno);
-        return -1;
     }
     return fd;
 }
 
-int FileMonitor::registerExceptionLogMonitor(int fd) {
-    int epfd = epoll_create(kEpollSizeHint);
-    if (epfd < 0) {
+unique_fd FileMonitor::registerExceptionLogMonitor(unique_fd& fd) {
+    unique_fd epfd(epoll_create(kEpollSizeHint));
+    if (!epfd.ok()) {
         OLOGE("%s epoll_create failed (errno=%d)", errno);
-        close(fd);
-        return -1;
+        fd.reset();
+        return epfd;
     }
     // EPOLLWAKEUP keeps the device awake while a record is pending; without the capability
     // for it the kernel quietly ignores the flag.
     struct epoll_event watch = {};
     watch.events = EPOLLPRI | EPOLLWAKEUP;
-    watch.data.fd = fd;
-    if (epoll_ctl(epfd, EPOLL_CTL_ADD, fd, &watch) < 0) {
+    watch.data.fd = fd.get();
+    if (epoll_ctl(epfd.get(), EPOLL_CTL_ADD, fd.get(), &watch) < 0) {
         OLOGE("%s epoll_ctl for exception log monitor failed; errno=%d", errno);
-        close(fd);
-        close(epfd);
-        return -1;
+        fd.reset();
+        return unique_fd();
     }
     return epfd;
 }
@@ -52,10 +57,8 @@ void FileMonitor::unregisterExceptionLogMonitor(int epfd, int fd) {
     }
 }
 
-void FileMonitor::destoryExceptionLogFd(int fd) {
-    if (fd != -1) {
-        close(fd);
-    }
+void FileMonitor::destoryExceptionLogFd(unique_fd& fd) {
+    fd.reset();
 }
 
 }  // namespace android

@@ -3,6 +3,8 @@
 
 #include <string>
 
+#include <android-base/unique_fd.h>
+
 namespace android {
 
 // Opening, epoll registration and tear-down of the kernel's exception log node, which
@@ -11,12 +13,17 @@ class FileMonitor {
 public:
     static constexpr const char* kExceptionLogPath = "/dev/qx_exception_log";
 
-    // The node opened read-only and close-on-exec, or -1.
-    int openExceptionLogFd(const std::string& path = kExceptionLogPath);
-    // A new epoll descriptor watching fd for priority data, or -1 (fd is then closed).
-    int registerExceptionLogMonitor(int fd);
+    // The node opened read-only and close-on-exec; invalid, with one error line, when it
+    // cannot be opened.
+    android::base::unique_fd openExceptionLogFd(const std::string& path = kExceptionLogPath);
+    // A new epoll descriptor watching fd for priority data; invalid when that cannot be set up,
+    // and fd is then closed.
+    android::base::unique_fd registerExceptionLogMonitor(android::base::unique_fd& fd);
     void unregisterExceptionLogMonitor(int epfd, int fd);
-    void destoryExceptionLogFd(int fd);
+    void destoryExceptionLogFd(android::base::unique_fd& fd);
+
+    // openExceptionLogFd without its line, for attempts to reopen a node that vanished.
+    static android::base::unique_fd OpenNode(const std::string& path);
 };
 
 }  // namespace android

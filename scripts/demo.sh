@@ -10,14 +10,17 @@
 #
 # usage: demo.sh             the demonstration (well under two minutes)
 #        demo.sh load [S]    load figures instead: throughput for S seconds per run (default 60)
+#        demo.sh flood [N [B]]  memory under a flood of N records of B bytes (default 100000, 3072)
 set -euo pipefail
 
 MODE=${1:-demo}
 LOAD_SECONDS=${2:-60}
+FLOOD_RECORDS=${2:-100000}
+FLOOD_BYTES=${3:-3072}
 case "$MODE" in
-    demo | load) ;;
+    demo | load | flood) ;;
     *)
-        echo "usage: $0 [load [SECONDS]]" >&2
+        echo "usage: $0 [load [SECONDS] | flood [RECORDS [BYTES]]]" >&2
         exit 2
         ;;
 esac
@@ -325,7 +328,20 @@ run_load() {
                 as dropped;"
 }
 
+# Memory under a flood: records written by four writers as fast as the node takes them; the
+# daemon's resident memory before, at its peak (VmHWM) and once it has gone idle.
+run_flood() {
+    [ -x "$BUILD/orvane-loadgen" ] || { echo "demo: $BUILD/orvane-loadgen is missing" >&2; exit 1; }
+    section "flood of $1 records of $2 bytes, 4 writers"
+    "$BUILD/orvane-loadgen" flood "$DEV/qxev" "$DAEMON_PID" 50 "$1" "$2" 4
+    if [ -x "$BUILD/orvanectl" ] && [ -S "$WORK/orvane.sock" ]; then
+        section "the daemon's counters"
+        "$BUILD/orvanectl" --workdir "$WORK" dump stats | grep -E "^(source|pipeline)\." || true
+    fi
+}
+
 case "$MODE" in
     demo) run_demo ;;
     load) run_load "$LOAD_SECONDS" ;;
+    flood) run_flood "$FLOOD_RECORDS" "$FLOOD_BYTES" ;;
 esac

@@ -10,7 +10,7 @@ packages=(
     android-platform-frameworks-native-headers
     # libcrypto: OpenSSL for the host build, BoringSSL's headers for the device syntax check
     libssl-dev android-libboringssl-dev
-    zip unzip libfuse3-dev fuse3 clang libclang-rt-14-dev
+    zip unzip libfuse3-dev fuse3 clang libclang-rt-14-dev python3
 )
 
 missing=()

@@ -7,6 +7,7 @@
 #include <utils/StrongPointer.h>
 
 #include "service/IOrvaneNativeService.h"
+#include "utils/daemon_stats.h"
 
 namespace android {
 namespace Orvane {
@@ -17,7 +18,8 @@ namespace Orvane {
 namespace BinderTransport {
 
 // Starts the threads that serve calls: at most maxThreads, plus the thread that joins later.
-void StartThreadPool(size_t maxThreads);
+// The host's transport counts the requests it rejects in stats.
+void StartThreadPool(size_t maxThreads, DaemonStats& stats);
 // False, with an error line, when the service cannot be published. workDir serves the host.
 bool AddService(const std::string& name, const sp<BBinder>& service, const std::string& workDir);
 // Serves calls on the calling thread; does not return in normal operation.

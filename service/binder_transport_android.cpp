@@ -10,7 +10,7 @@ namespace android {
 namespace Orvane {
 namespace BinderTransport {
 
-void StartThreadPool(size_t maxThreads) {
+void StartThreadPool(size_t maxThreads, DaemonStats&) {
     sp<ProcessState> process = ProcessState::self();
     process->setThreadPoolMaxThreadCount(maxThreads);
     process->startThreadPool();

@@ -15,7 +15,8 @@ namespace Orvane {
 class OrvaneNativeService : public BnOrvaneNativeService {
 public:
     // With checkCaller on, only the companion application (uid 1000, process
-    // "com.quor.orvaneservice") is served.
+    // "com.quor.orvaneservice") is served. Dumps are not for it to check: they are served to
+    // callers with the platform's DUMP permission (see dump).
     OrvaneNativeService(const sp<OrvaneService>& service, bool checkCaller);
 
     binder::Status notifyPackLog(int* result) override;
@@ -30,6 +31,8 @@ private:
     bool CanProcess();
     // The error of a method that finds no service.
     static binder::Status ServiceIsNull(const char* method, int line);
+    // Adds one to the daemon's counter `name`.
+    void Count(const char* name);
 
     const sp<OrvaneService> service_;
     const bool checkCaller_;

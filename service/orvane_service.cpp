@@ -1,9 +1,19 @@
 #include "service/orvane_service.h"
 
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <new>
 
+#include <android-base/unique_fd.h>
+
 #include "service/binder_transport.h"
+#include "service/caller_writer.h"
 #include "service/orvane_native_service.h"
 #include "utils/dev_info.h"
 #include "utils/orvane_log.h"
@@ -13,7 +23,11 @@ namespace android {
 namespace Orvane {
 namespace {
 
+using android::base::unique_fd;
+
 constexpr size_t kBinderThreads = 4;
+// The dump text goes to the caller in pieces of this size.
+constexpr size_t kDumpChunkBytes = 64 * 1024;
 constexpr uint32_t kControlEventType = 1;
 constexpr uint32_t kPackLogEventId = 101;
 constexpr uint32_t kUploadSwitchEventId = 103;
@@ -26,14 +40,15 @@ const char* const kStorageManager = "EventStorageManager";
 
 OrvaneService::OrvaneService(PluginPlatform* platform) : platform_(platform) {}
 
-void OrvaneService::StartService() {
-    BinderTransport::StartThreadPool(kBinderThreads);
+bool OrvaneService::StartService() {
+    BinderTransport::StartThreadPool(kBinderThreads, platform_->GetStats());
     bool checkCaller = platform_->GetSysProperity("persist.sys.orvane.safecheck", "1") != "0";
     sp<OrvaneNativeService> service = new OrvaneNativeService(this, checkCaller);
     if (!BinderTransport::AddService("orvane", service, platform_->GetWorkDir())) {
-        return;
+        return false;
     }
     BinderTransport::JoinThreadPool();
+    return true;
 }
 
 sp<Event> OrvaneService::CreateEvent(const char* op, uint32_t eventId) {
@@ -91,6 +106,38 @@ void OrvaneService::NotifyUserActivated() {
 }
 
 void OrvaneService::Dump(int fd, const std::vector<std::string>& args) {
+    DaemonStats& stats = platform_->GetStats();
+    // Sized to the cap, then sealed against growing: a write past the cap fails instead of
+    // taking more memory, and the file offset tells how much was written.
+    unique_fd text(memfd_create("orvane_dump", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+    if (!text.ok() || ftruncate(text.get(), kMaxDumpBytes) != 0 ||
+        fcntl(text.get(), F_ADD_SEALS, F_SEAL_GROW | F_SEAL_SHRINK) != 0) {
+        OLOGE_LIMITED("%s no memory file for the dump: %s", strerror(errno));
+        stats.Add("service.dump.write_failures");
+        return;
+    }
+    WriteDump(text.get(), args);
+    const off_t length = lseek(text.get(), 0, SEEK_CUR);
+    const auto deadline = std::chrono::steady_clock::now() + kDumpDeliveryBound;
+    bool delivered = true;
+    std::vector<char> chunk(std::min<size_t>(length, kDumpChunkBytes));
+    for (off_t done = 0; delivered && done < length;) {
+        ssize_t n = pread(text.get(), chunk.data(), std::min<off_t>(chunk.size(), length - done), done);
+        delivered = n > 0 && CallerWriter::Write(fd, chunk.data(), n, deadline);
+        done += n;
+    }
+    if (static_cast<size_t>(length) >= kMaxDumpBytes) {
+        stats.Add("service.dump.cut");
+        std::string note = "\n[dump cut at " + std::to_string(kMaxDumpBytes) + " bytes]\n";
+        delivered = delivered && CallerWriter::Write(fd, note.data(), note.size(), deadline);
+    }
+    if (!delivered) {
+        stats.Add("service.dump.write_failures");
+        OLOGW_LIMITED("%s the caller did not take all of the dump's %lld bytes", static_cast<long long>(length));
+    }
+}
+
+void OrvaneService::WriteDump(int fd, const std::vector<std::string>& args) {
     if (args.empty()) {
         DumpPluginSummaryInfo(fd);
     } else if (args.size() >= 2 && args[0] == "plugin") {

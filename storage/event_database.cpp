@@ -1,14 +1,23 @@
 #include "storage/event_database.h"
 
+#include <dirent.h>
+#include <errno.h>
+#include <sqlite3.h>
 #include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
-#include <mutex>
+#include <memory>
+
+#include <android-base/file.h>
+#include <utils/Mutex.h>
 
 #include "storage/event_table.h"
 #include "utils/file_util.h"
 #include "utils/orvane_log.h"
 #include "utils/string_util.h"
+#include "utils/time_util.h"
 #include "utils/trace.h"
 
 namespace android {
@@ -16,19 +25,53 @@ namespace Orvane {
 
 namespace {
 // Guards the creation of the single instance, nothing else.
-std::mutex g_eventDatabaseMutex;
+Mutex g_instanceMutex;
+sp<EventDatabase> g_instance GUARDED_BY(g_instanceMutex);
+
+// A damaged file is kept beside the fresh one as <name>.corrupt-<time>, with its companions.
+constexpr char kCorruptInfix[] = ".corrupt-";
+constexpr const char* kCompanionSuffixes[] = {"-journal", "-wal", "-shm"};
+// Rows per trimming statement: each statement's journal must fit on a nearly full disk; a
+// statement that still fails is retried with half as many rows.
+constexpr int64_t kDeleteBatchRows = 256;
+
+void Bump(DaemonStats::Counter* counter) {
+    if (counter != nullptr) {
+        counter->fetch_add(1, std::memory_order_relaxed);
+    }
+}
+
+bool IsSymbolicLink(const std::string& path) {
+    struct stat st;
+    return lstat(path.c_str(), &st) == 0 && S_ISLNK(st.st_mode);
+}
+
+// Removes a file and its companions; false when the file itself stays.
+bool RemoveWithCompanions(const std::string& path) {
+    for (const char* suffix : kCompanionSuffixes) {
+        unlink((path + suffix).c_str());
+    }
+    return unlink(path.c_str()) == 0 || errno == ENOENT;
+}
 }  // namespace
 
 sp<EventDatabase> EventDatabase::getInstance() {
-    static sp<EventDatabase> instance;
-    std::lock_guard<std::mutex> lock(g_eventDatabaseMutex);
-    if (instance == nullptr) {
-        instance = new EventDatabase();
+    Mutex::Autolock lock(g_instanceMutex);
+    if (g_instance == nullptr) {
+        g_instance = new EventDatabase();
     }
-    return instance;
+    return g_instance;
+}
+
+void EventDatabase::SetStats(DaemonStats* stats) {
+    owner_.Check(__func__);
+    errors_ = stats != nullptr ? &stats->Get("storage.db.errors") : nullptr;
+    recovered_ = stats != nullptr ? &stats->Get("storage.db.recovered") : nullptr;
+    linksRefused_ = stats != nullptr ? &stats->Get("storage.db.link_refused") : nullptr;
 }
 
 void EventDatabase::InitDatabase(const std::string& path) {
+    owner_.Check(__func__);
     if (initialised_) {
         OLOGW("%s init data base already init");
         return;
@@ -40,23 +83,120 @@ void EventDatabase::InitDatabase(const std::string& path) {
         tables_[table->GetTableName()] = table;
     }
     database_ = new SqlDatabase(path);
-    bool existed = FileUtil::FileExists(path);
+    // A link would let whoever placed it choose which file the daemon writes.
+    if (IsSymbolicLink(path)) {
+        OLOGE("%s refusing db %s, it is a symbolic link", path.c_str());
+        Bump(linksRefused_);
+        return;
+    }
+    OpenFile();
+}
+
+void EventDatabase::OpenFile() {
+    bool existed = FileUtil::FileExists(database_->GetPath());
     if (!database_->Open()) {
+        Bump(errors_);
         return;
     }
     initialised_ = true;
     for (const auto& [name, table] : tables_) {
-        OLOGD("%s create table %s", name.c_str());
-        if (!database_->ExecuteSql(table->GenerateCreateTableStatement())) {
+        OLOG_AS(ANDROID_LOG_DEBUG, "InitDatabase", "%s create table %s", name.c_str());
+        if (!Run(table->GenerateCreateTableStatement())) {
             return;
         }
         if (existed && !UpdateTableColumn(table)) {
-            OLOGI("%s update failed");
+            OLOG_AS(ANDROID_LOG_INFO, "InitDatabase", "%s update failed");
         }
     }
 }
 
-sp<BaseTable> EventDatabase::GetTable(const std::string& name) const {
+bool EventDatabase::Run(const std::string& sql) {
+    owner_.Check(__func__);
+    if (database_->ExecuteSql(sql)) {
+        return true;
+    }
+    if (!Failed()) {
+        return false;
+    }
+    if (database_->ExecuteSql(sql)) {
+        return true;
+    }
+    Bump(errors_);
+    return false;
+}
+
+std::vector<SqlRow> EventDatabase::Fetch(const std::string& sql, const std::vector<std::string>& fieldNames) {
+    owner_.Check(__func__);
+    std::vector<SqlRow> rows = database_->QueryRecord(sql, fieldNames);
+    if (database_->GetLastCode() == SQLITE_OK || !Failed()) {
+        return rows;
+    }
+    rows = database_->QueryRecord(sql, fieldNames);
+    if (database_->GetLastCode() != SQLITE_OK) {
+        Bump(errors_);
+    }
+    return rows;
+}
+
+// Counts a failed statement; true when it found the file damaged and a fresh one took its place.
+bool EventDatabase::Failed() {
+    Bump(errors_);
+    return database_->LastFailureIsCorruption() && RecoverFromCorruption();
+}
+
+// What Android does with a damaged database: the file goes, a fresh one with empty tables comes,
+// and the owner puts its start-up rows back. A damaged fresh file is not replaced again at once.
+bool EventDatabase::RecoverFromCorruption() {
+    if (recovering_) {
+        return false;
+    }
+    recovering_ = true;
+    MoveAside();
+    if (database_ != nullptr) {
+        OpenFile();
+    }
+    if (initialised_ && recoveryListener_) {
+        recoveryListener_();
+    }
+    recovering_ = false;
+    return initialised_;
+}
+
+void EventDatabase::MoveAside() {
+    std::string path = database_->GetPath();
+    std::string reason = database_->GetLastError();
+    database_->Close();
+    initialised_ = false;
+    // Only the newest damaged copy is kept.
+    std::string folder = base::Dirname(path);
+    std::string prefix = base::Basename(path) + kCorruptInfix;
+    std::unique_ptr<DIR, int (*)(DIR*)> dir(opendir(folder.c_str()), closedir);
+    for (struct dirent* entry; dir != nullptr && (entry = readdir(dir.get())) != nullptr;) {
+        if (StringUtil::StartsWith(entry->d_name, prefix)) {
+            unlink((folder + "/" + entry->d_name).c_str());
+        }
+    }
+    std::string copy = path + kCorruptInfix + TimeUtil::GetTimeDateStr(TimeUtil::GetTimestampSecond(), "%Y%m%d%H%M%S");
+    bool moved = FileUtil::MoveFile(path, copy);
+    for (const char* suffix : kCompanionSuffixes) {
+        // A journal left behind would be rolled back into the fresh file.
+        if (moved && FileUtil::FileExists(path + suffix) && !FileUtil::MoveFile(path + suffix, copy + suffix)) {
+            unlink((path + suffix).c_str());
+        }
+    }
+    if (!moved && !RemoveWithCompanions(path)) {
+        OLOGE_LIMITED("%s db %s is corrupt (%s) and cannot be moved or removed, storing stops", path.c_str(),
+                      reason.c_str());
+        database_ = nullptr;
+        return;
+    }
+    OLOGE_LIMITED("%s db %s is corrupt (%s), moved to %s, starting a fresh one", path.c_str(), reason.c_str(),
+                  moved ? copy.c_str() : "nowhere");
+    Bump(recovered_);
+}
+
+sp<BaseTable> EventDatabase::GetTable(const std::string& name) {
+    owner_.Check(__func__);
     auto it = tables_.find(name);
     return it == tables_.end() ? nullptr : it->second;
 }
@@ -76,7 +216,7 @@ bool EventDatabase::Insert(const std::string& table, std::vector<std::string> na
         return false;
     }
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return false;
     }
     sp<BaseTable> tbl = GetTable(table);
@@ -89,17 +229,16 @@ bool EventDatabase::Insert(const std::string& table, std::vector<std::string> na
         OLOGE("%s generate sql failed");
         return false;
     }
-    return database_->ExecuteSql(sql);
+    return Run(sql);
 }
 
 int32_t EventDatabase::InsertAndGetID(const std::string& table, std::vector<std::string> names,
                                       std::vector<std::string> values) {
     if (!Insert(table, std::move(names), std::move(values))) {
-        OLOGE("%s insert %s failed", table.c_str());
+        OLOGE_LIMITED("%s insert %s failed", table.c_str());
         return 0;
     }
-    std::vector<SqlRow> rows =
-            database_->QueryRecord("select id from " + table + " order by id desc limit 1", {kColId});
+    std::vector<SqlRow> rows = Fetch("select id from " + table + " order by id desc limit 1", {kColId});
     OLOGD("%s get id from %s", table.c_str());
     return rows.empty() ? 0 : StringUtil::ConvertInt(rows[0][kColId]);
 }
@@ -111,47 +250,89 @@ bool EventDatabase::Update(const std::string& table, std::vector<std::string> na
         return false;
     }
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return false;
     }
     sp<BaseTable> tbl = GetTable(table);
     if (tbl == nullptr) {
         return false;
     }
-    return database_->ExecuteSql(tbl->BuildUpdateStatement(std::move(names), std::move(values)) +
-                                 query.GetWhereStatement());
+    return Run(tbl->BuildUpdateStatement(std::move(names), std::move(values)) + query.GetWhereStatement());
 }
 
 std::vector<SqlRow> EventDatabase::Query(const std::string& table, EventQuery query, int32_t limit) {
     ScopedTrace trace("DB_Query");
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return {};
     }
     std::string sql = query.BuildQueryStatement(table, limit);
     if (sql.empty()) {
         return {};
     }
-    return database_->QueryRecord(sql, query.GetSelectList());
+    return Fetch(sql, query.GetSelectList());
 }
 
 bool EventDatabase::Delete(const std::string& table, EventQuery query) {
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return false;
     }
-    return database_->ExecuteSql("delete from " + table + query.GetWhereStatement());
+    return Run("delete from " + table + query.GetWhereStatement());
+}
+
+int64_t EventDatabase::DeleteOldest(const std::string& table, const std::string& timeColumn, int64_t maxRows) {
+    return DeleteInBatches(table, timeColumn, "", maxRows);
+}
+
+int64_t EventDatabase::DeleteOlderThan(const std::string& table, const std::string& timeColumn, int64_t cutOff) {
+    return DeleteInBatches(table, timeColumn,
+                           " where " + timeColumn + " is null or " + timeColumn + " < " + std::to_string(cutOff),
+                           INT64_MAX);
+}
+
+int64_t EventDatabase::DeleteInBatches(const std::string& table, const std::string& timeColumn,
+                                       const std::string& condition, int64_t maxRows) {
+    if (!initialised_) {
+        OLOGE_LIMITED("%s database not init");
+        return 0;
+    }
+    int64_t deleted = 0;
+    int64_t batch = kDeleteBatchRows;
+    while (deleted < maxRows && initialised_) {
+        batch = std::min(batch, maxRows - deleted);
+        std::string oldest = "select id from " + table + condition + " order by " + timeColumn + ", id limit " +
+                             std::to_string(batch);
+        if (!Run("delete from " + table + " where id in (" + oldest + ")")) {
+            if (batch == 1) {
+                break;
+            }
+            batch /= 2;
+            continue;
+        }
+        int64_t changes = database_->GetChanges();
+        if (changes == 0) {
+            break;
+        }
+        deleted += changes;
+    }
+    return deleted;
 }
 
 bool EventDatabase::TruncateAndCreate(const std::string& table) {
-    if (!initialised_ || !database_->TruncateTable(table)) {
+    if (!initialised_) {
+        return false;
+    }
+    owner_.Check(__func__);
+    if (!database_->TruncateTable(table)) {
+        Failed();
         return false;
     }
     sp<BaseTable> tbl = GetTable(table);
     if (tbl == nullptr) {
         return false;
     }
-    return database_->ExecuteSql(tbl->GenerateCreateTableStatement());
+    return Run(tbl->GenerateCreateTableStatement());
 }
 
 bool EventDatabase::UpdateTableColumn(const sp<BaseTable>& table) {
@@ -159,8 +340,7 @@ bool EventDatabase::UpdateTableColumn(const sp<BaseTable>& table) {
         return false;
     }
     const std::string& name = table->GetTableName();
-    std::vector<SqlRow> existing =
-            database_->QueryRecord("select name from pragma_table_info('" + name + "')", {"name"});
+    std::vector<SqlRow> existing = Fetch("select name from pragma_table_info('" + name + "')", {"name"});
     if (existing.empty()) {
         OLOGI("%s query table %s failed", name.c_str());
         return false;
@@ -174,7 +354,7 @@ bool EventDatabase::UpdateTableColumn(const sp<BaseTable>& table) {
             continue;
         }
         OLOGI("%s Add column %s", field->GetName().c_str());
-        bool alterOk = database_->ExecuteSql("ALTER TABLE " + name + " ADD COLUMN " + field->GetFieldStatement());
+        bool alterOk = Run("ALTER TABLE " + name + " ADD COLUMN " + field->GetFieldStatement());
         ok = ok && alterOk;
         added = true;
     }
@@ -200,33 +380,35 @@ void EventDatabase::RaiseDbRevision() {
 
 bool EventDatabase::Vacuum() {
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return false;
     }
-    return database_->ExecuteSql("VACUUM");
+    return Run("VACUUM");
 }
 
 int64_t EventDatabase::GetLiveSize() {
     if (!initialised_) {
-        OLOGE("%s database not init");
+        OLOGE_LIMITED("%s database not init");
         return -1;
     }
-    std::vector<SqlRow> rows = database_->QueryRecord(
-            "select (page_count - freelist_count) * page_size from pragma_page_count, pragma_freelist_count, "
-            "pragma_page_size",
-            {"size"});
+    std::vector<SqlRow> rows =
+            Fetch("select (page_count - freelist_count) * page_size from pragma_page_count, pragma_freelist_count, "
+                  "pragma_page_size",
+                  {"size"});
     return rows.empty() ? -1 : strtoll(rows[0]["size"].c_str(), nullptr, 10);
 }
 
 void EventDatabase::Close() {
-    if (database_ == nullptr) {
-        return;
+    if (database_ != nullptr) {
+        OLOGI("%s event data base closed");
+        initialised_ = false;
+        database_->Close();
+        database_ = nullptr;
+        tables_.clear();
     }
-    OLOGI("%s event data base closed");
-    initialised_ = false;
-    database_->Close();
-    database_ = nullptr;
-    tables_.clear();
+    recoveryListener_ = nullptr;
+    errors_ = recovered_ = linksRefused_ = nullptr;
+    owner_.Detach();
 }
 
 }  // namespace Orvane

@@ -3,11 +3,19 @@
 #include <errno.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/statvfs.h>
+
+#include <algorithm>
+#include <cinttypes>
+#include <cmath>
+
+#include <android-base/file.h>
 
 #include "config/event_upload_xml_parser.h"
 #include "config/event_xml_parser.h"
 #include "storage/event_table.h"
 #include "utils/dev_info.h"
+#include "utils/file_util.h"
 #include "utils/orvane_log.h"
 #include "utils/string_util.h"
 #include "utils/time_util.h"
@@ -18,9 +26,14 @@ namespace Orvane {
 namespace {
 constexpr uint64_t kDaySeconds = 86400;
 constexpr uint64_t kHourSeconds = 3600;
+// A happen time further ahead of the wall clock than this is taken as the clock's time, and a
+// stored day start further ahead is brought back to today at start-up.
+constexpr uint64_t kFutureMarginSeconds = 86400;
 // Abridging first removes what is older than 60 days.
 constexpr uint64_t kAbridgeKeepSeconds = 5184000;
-constexpr int kAbridgeMaxRounds = 8;
+// Later rounds take the oldest rows in proportion to the excess, at least this many per table.
+constexpr int kAbridgeMaxRounds = 16;
+constexpr int64_t kAbridgeMinRows = 8;
 constexpr int32_t kDumpDefaultRows = 20;
 constexpr uint32_t kOverQuotaEventId = 908001001;
 constexpr uint32_t kFaultEventType = 2;
@@ -50,6 +63,12 @@ uint64_t ToU64(const std::string& text) {
     return strtoull(text.c_str(), nullptr, 10);
 }
 
+// The rows to take from a table of `rows` rows to remove `excess` (a share) of its data.
+int64_t ShareOf(int64_t rows, double excess) {
+    int64_t share = static_cast<int64_t>(std::ceil(static_cast<double>(rows) * excess));
+    return std::min(rows, std::max(share, kAbridgeMinRows));
+}
+
 std::string Join(const std::vector<std::string>& items, const char* separator) {
     std::string joined;
     for (size_t i = 0; i < items.size(); i++) {
@@ -72,11 +91,30 @@ bool EventDatabaseHelper::Init(PluginContext* context, const std::string& fileNa
         };
     }
     dbPath_ = context->GetWorkDir() + fileName;
+    DaemonStats& stats = context->GetStats();
+    stored_ = &stats.Get("storage.events.stored");
+    storeFailed_ = &stats.Get("storage.events.store_failed");
+    droppedOverQuota_ = &stats.Get("storage.events.dropped.over_daily_quota");
+    droppedPunished_ = &stats.Get("storage.events.dropped.punished");
+    futureTimes_ = &stats.Get("storage.events.future_time");
+    dayStartHealed_ = &stats.Get("storage.day_start.healed");
+    trimRuns_ = &stats.Get("storage.trim.runs");
+    trimRows_ = &stats.Get("storage.trim.rows");
+    vacuumSkipped_ = &stats.Get("storage.trim.vacuum_skipped");
     database_ = EventDatabase::getInstance();
+    database_->SetStats(&stats);
     database_->InitDatabase(dbPath_);
     if (!database_->IsInitialised()) {
         return false;
     }
+    // A damaged file is replaced by an empty one, which needs its version rows again.
+    wp<EventDatabaseHelper> weak = this;
+    database_->SetRecoveryListener([weak]() {
+        sp<EventDatabaseHelper> self = weak.promote();
+        if (self != nullptr) {
+            self->InitVersionRows();
+        }
+    });
     InitVersionRows();
     return true;
 }
@@ -98,21 +136,50 @@ void EventDatabaseHelper::InitVersionRows() {
     } else {
         dbVersionRowId_ = StringUtil::ConvertInt(rows[0][kColId]);
         dbStartTime_ = ToU64(rows[0][kColStartTime]);
+        HealFutureDayStart();
     }
     OLOG_AS(ANDROID_LOG_INFO, "Init", "%s version %s id=%d, db version id=%d, start time=%lu", osVersion_.c_str(),
             versionId_, dbVersionRowId_, static_cast<unsigned long>(dbStartTime_));
+}
+
+// No event can start a new day before the stored day start plus a day, so a day start far ahead of
+// the clock (left by a daemon that took absurd happen times as they came) would stop the daily
+// counting until then.
+void EventDatabaseHelper::HealFutureDayStart() {
+    uint64_t now = TimeUtil::GetTimestampSecond();
+    if (now == 0 || dbStartTime_ <= now + kFutureMarginSeconds) {
+        return;
+    }
+    uint64_t today = static_cast<uint64_t>(TimeUtil::GetZeroTimestampSec(static_cast<int64_t>(now)));
+    OLOG_AS(ANDROID_LOG_WARN, "Init",
+            "%s day start %" PRIu64 " lies beyond the clock %" PRIu64 ", starts again at %" PRIu64, dbStartTime_, now,
+            today);
+    dbStartTime_ = today;
+    EventQuery byId;
+    byId.And(kColId, EventQuery::EQ, static_cast<int64_t>(dbVersionRowId_));
+    database_->Update(kTblDbVersion, {kColStartTime}, {std::to_string(dbStartTime_)}, byId);
+    dayStartHealed_->fetch_add(1, std::memory_order_relaxed);
 }
 
 EventDatabaseHelper::DomainQuota EventDatabaseHelper::GetQuota(uint32_t eventId) {
     if (context_ == nullptr) {
         return DomainQuota();
     }
-    return EventQuotaXmlParser::getInstance()->GetEventQuota(context_->GetConfigDir(), osVersion_, eventId);
+    return EventQuotaXmlParser::getInstance()->GetEventQuota(*context_, osVersion_, eventId);
 }
 
 void EventDatabaseHelper::ProcessFaultEvent(sp<Event> event) {
     if (context_ == nullptr || event == nullptr) {
         return;
+    }
+    // Taken as it came, such a time would move the counting day far ahead (see HealFutureDayStart).
+    uint64_t now = TimeUtil::GetTimestampSecond();
+    if (now != 0 && event->happenTime > now + kFutureMarginSeconds) {
+        OLOGW_LIMITED("%s event %u happen time %" PRIu64 " is more than %" PRIu64
+                      " s ahead of the clock, taken as %" PRIu64,
+                      event->eventId, event->happenTime, kFutureMarginSeconds, now);
+        futureTimes_->fetch_add(1, std::memory_order_relaxed);
+        event->happenTime = now;
     }
     if (DetectCanDrop(event)) {
         return;
@@ -128,25 +195,28 @@ void EventDatabaseHelper::ProcessFaultEvent(sp<Event> event) {
             .And(kColFirstTime, EventQuery::LT, dayStart + static_cast<int64_t>(kDaySeconds));
     std::vector<SqlRow> rows = database_->Query(kTblEventInfo, sameDay, 1);
     std::string happenTime = std::to_string(event->happenTime);
+    bool stored = false;
     if (rows.empty()) {
-        database_->Insert(
+        stored = database_->Insert(
                 kTblEventInfo,
                 {kColEventId, kColVersionId, kColOccuredCnt, kColFirstTime, kColParamList, kColExpire, kColVisible},
                 {std::to_string(event->eventId), std::to_string(versionId_), "1", happenTime, params,
                  MarkOrZero(event->GetValue(kKeyExpire)), MarkOrZero(event->GetValue(kKeyVisible))});
-        return;
+    } else {
+        // first_time follows the latest occurrence of the day, so the row stays matched all day.
+        int64_t occurred = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][kColOccuredCnt])) + 1;
+        EventQuery byId;
+        byId.And(kColId, EventQuery::EQ, rows[0][kColId]);
+        stored = database_->Update(kTblEventInfo, {kColOccuredCnt, kColFirstTime},
+                                   {std::to_string(occurred), happenTime}, byId);
     }
-    // first_time follows the latest occurrence of the day, so the row stays matched all day.
-    int64_t occurred = static_cast<int64_t>(StringUtil::ConvertInt(rows[0][kColOccuredCnt])) + 1;
-    EventQuery byId;
-    byId.And(kColId, EventQuery::EQ, rows[0][kColId]);
-    database_->Update(kTblEventInfo, {kColOccuredCnt, kColFirstTime}, {std::to_string(occurred), happenTime}, byId);
+    (stored ? stored_ : storeFailed_)->fetch_add(1, std::memory_order_relaxed);
 }
 
 bool EventDatabaseHelper::DetectCanDrop(sp<Event> event) {
     if (!ProcessNewDayEvent(event)) {
         if (database_->GetTable(kTblEventDaily) == nullptr) {
-            OLOGE("%s failed get tbl %s no drop", kTblEventDaily);
+            OLOGE_LIMITED("%s failed get tbl %s no drop", kTblEventDaily);
             return false;
         }
         EventQuery byEvent;
@@ -190,6 +260,7 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
         overCnt++;
         ReportEventOverQuota(event, dailyCnt, maxCnt);
         OLOGI("%s event %d over daily cnt drop it, dailyCnt=%d maxCnt=%u", eventId, static_cast<int>(dailyCnt), maxCnt);
+        droppedOverQuota_->fetch_add(1, std::memory_order_relaxed);
         dropped = true;
     } else {
         uint64_t now = event->happenTime;
@@ -208,6 +279,7 @@ bool EventDatabaseHelper::DetectDropByTime(sp<Event> event, SqlRow& row) {
                       static_cast<int>(newHour), static_cast<int>(halfCnt), maxCnt);
                 dailyCnt--;  // the stored count stays as it was
                 overCnt++;
+                droppedPunished_->fetch_add(1, std::memory_order_relaxed);
                 dropped = true;
             } else {
                 hourCnt = static_cast<uint32_t>(newHour);
@@ -278,8 +350,7 @@ uint64_t EventDatabaseHelper::CheckAndGetLogTime(sp<Event> event, const DomainQu
         event->SetValue(kKeyNoCatchLog, kNoLogConfig);
         return lastLogTime;
     }
-    sp<EventInfoConfig> info =
-            EventXmlParser::getInstance()->GetEventInfoConfig(context_->GetConfigDir(), event->eventId);
+    sp<EventInfoConfig> info = EventXmlParser::getInstance()->GetEventInfoConfig(*context_, event->eventId);
     int32_t spacing = info != nullptr ? info->extendS : 0;
     uint64_t now = event->happenTime;
     bool tooSoon = spacing > 0 && now < lastLogTime + static_cast<uint64_t>(spacing);
@@ -311,35 +382,74 @@ void EventDatabaseHelper::SaveUserActivateTime(sp<Event> event) {
     DevInfo::SetActivateTime(event->happenTime);
 }
 
-int32_t EventDatabaseHelper::CountRows(const std::string& table, EventQuery query) {
-    std::vector<SqlRow> rows = database_->Query(table, query.Select({"count(*)"}), 1);
+int64_t EventDatabaseHelper::CountRows(const std::string& table) {
+    EventQuery all;
+    std::vector<SqlRow> rows = database_->Query(table, all.Select({"count(*)"}), 1);
     return rows.empty() ? 0 : StringUtil::ConvertInt(rows[0]["count(*)"]);
 }
 
+// The cap holds for the stored data: rows older than 60 days go first, then, while the data is still
+// at or above the cap, the oldest rows of each event table in proportion to the excess, today's
+// included. The bookkeeping tables (event_daily, db_version, version) are never trimmed.
 void EventDatabaseHelper::AbridgeDbSize(uint32_t sizeLimit) {
-    if (database_ == nullptr) {
+    if (context_ == nullptr || database_ == nullptr || !database_->IsInitialised()) {
         return;
     }
+    trimRuns_->fetch_add(1, std::memory_order_relaxed);
+    bool canVacuum = HasRoomToVacuum();
     uint64_t now = TimeUtil::GetTimestampSecond();
-    uint64_t cutOff = now > kAbridgeKeepSeconds ? now - kAbridgeKeepSeconds : 0;
-    for (int round = 1; round <= kAbridgeMaxRounds; round++) {
-        EventQuery oldEvents;
-        oldEvents.And(kColFirstTime, EventQuery::LT, static_cast<int64_t>(cutOff));
-        EventQuery oldRaw;
-        oldRaw.And(kColTimestamp, EventQuery::LT, static_cast<int64_t>(cutOff));
-        int32_t events = CountRows(kTblEventInfo, oldEvents);
-        int32_t raws = CountRows(kTblRawEvents, oldRaw);
-        database_->Delete(kTblEventInfo, oldEvents);
-        database_->Delete(kTblRawEvents, oldRaw);
-        int64_t liveSize = database_->GetLiveSize();
-        OLOGI("%s round %d cut-off %lu deleted %d events %d raw events, %ld bytes left", round,
-              static_cast<unsigned long>(cutOff), events, raws, static_cast<long>(liveSize));
-        if (liveSize < static_cast<int64_t>(sizeLimit)) {
+    int64_t cutOff = static_cast<int64_t>(now > kAbridgeKeepSeconds ? now - kAbridgeKeepSeconds : 0);
+    int64_t deleted = database_->DeleteOlderThan(kTblEventInfo, kColFirstTime, cutOff) +
+                      database_->DeleteOlderThan(kTblRawEvents, kColTimestamp, cutOff);
+    int64_t liveSize = Compact(canVacuum);
+    OLOGI("%s round 1 cut-off %" PRId64 " deleted %" PRId64 " rows, %" PRId64 " bytes left", cutOff, deleted, liveSize);
+    for (int round = 2; liveSize >= static_cast<int64_t>(sizeLimit) && round <= kAbridgeMaxRounds; round++) {
+        int64_t events = CountRows(kTblEventInfo);
+        int64_t raws = CountRows(kTblRawEvents);
+        if (events + raws == 0) {
+            OLOGW("%s no events left to trim, %" PRId64 " bytes stay at or above the cap %u", liveSize, sizeLimit);
             break;
         }
-        cutOff += (now - cutOff) / 2;
+        double excess = static_cast<double>(liveSize - static_cast<int64_t>(sizeLimit)) / static_cast<double>(liveSize);
+        int64_t removed = database_->DeleteOldest(kTblEventInfo, kColFirstTime, ShareOf(events, excess)) +
+                          database_->DeleteOldest(kTblRawEvents, kColTimestamp, ShareOf(raws, excess));
+        liveSize = Compact(canVacuum);
+        OLOGI("%s round %d deleted the oldest %" PRId64 " rows, %" PRId64 " bytes left", round, removed, liveSize);
+        deleted += removed;
+        if (removed == 0) {
+            break;
+        }
     }
-    database_->Vacuum();
+    trimRows_->fetch_add(static_cast<uint64_t>(deleted), std::memory_order_relaxed);
+}
+
+// A vacuum writes a copy of the live data and journals the pages it rewrites; on a disk without
+// room for both it would fail after doing most of the work. Freed pages are reused by later rows
+// either way, so the file only shrinks when there is room for that.
+bool EventDatabaseHelper::HasRoomToVacuum() {
+    uint64_t fileSize = static_cast<uint64_t>(std::max<int64_t>(FileUtil::GetFileSize(dbPath_), 0));
+    struct statvfs fs;
+    uint64_t room = statvfs(base::Dirname(dbPath_).c_str(), &fs) == 0
+                            ? static_cast<uint64_t>(fs.f_bavail) * static_cast<uint64_t>(fs.f_frsize)
+                            : 0;
+    if (room >= 2 * fileSize) {
+        return true;
+    }
+    OLOGI("%s %" PRIu64 " bytes free, %" PRIu64 " needed to vacuum %s; its freed pages are reused instead", room,
+          2 * fileSize, dbPath_.c_str());
+    vacuumSkipped_->fetch_add(1, std::memory_order_relaxed);
+    return false;
+}
+
+// The bytes of the pages that hold data, after giving the free ones back when `canVacuum`; a
+// vacuum also packs what is left, so that the next round's share is measured on real data.
+int64_t EventDatabaseHelper::Compact(bool& canVacuum) {
+    int64_t liveSize = database_->GetLiveSize();
+    if (canVacuum && liveSize >= 0 && liveSize < FileUtil::GetFileSize(dbPath_)) {
+        canVacuum = database_->Vacuum();
+        liveSize = database_->GetLiveSize();
+    }
+    return liveSize;
 }
 
 void EventDatabaseHelper::DumpQueryDb(int fd, const std::vector<std::string>& args) {
@@ -413,7 +523,7 @@ void EventDatabaseHelper::DumpQuota(int fd, const std::string& eventId) {
     DomainQuota quota = GetQuota(id);
     // The range comes with the log counting lookup; an increment of 0 counts nothing.
     DomainQuota range;
-    EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(context_->GetConfigDir(), osVersion_, id, 0, &range);
+    EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, 0, &range);
     dprintf(fd,
             "EventId %u quota :\n    dailyCnt = %u\n    logCnt = %u    realLog = %u    logSpace = %u    sameLog = %u   "
             " "

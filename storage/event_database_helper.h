@@ -19,8 +19,8 @@ namespace Orvane {
 // The storage bookkeeping: counts fault events under their quotas, drops or records them,
 // keeps the day state, stores raw events and the activation time, shrinks the file and
 // answers the dump commands.
-// Threads: owned by the storage plugin and used only on its loop, except the dump commands,
-// which the service runs while the loop is the only other user of the database. No locks.
+// Threads: owned by the storage plugin and used only on its loop (the dump commands run there
+// too), like the database it reaches. No locks.
 class EventDatabaseHelper : public RefBase {
 public:
     using DomainQuota = EventQuotaXmlParser::DomainQuota;
@@ -41,7 +41,8 @@ public:
 
     void SaveRawEvent(sp<Event> event);
     void SaveUserActivateTime(sp<Event> event);
-    // Removes the oldest events until the stored data is below `sizeLimit` bytes.
+    // Removes the oldest events until the stored data is below `sizeLimit` bytes, then gives the
+    // space back when the disk has room for that.
     void AbridgeDbSize(uint32_t sizeLimit);
 
     void DumpQueryDb(int fd, const std::vector<std::string>& args);
@@ -57,11 +58,14 @@ public:
 
 private:
     void InitVersionRows();
+    void HealFutureDayStart();
+    bool HasRoomToVacuum();
+    int64_t Compact(bool& canVacuum);
     // Reports the first daily-quota drop of an event id in a day as an event of its own.
     void ReportEventOverQuota(sp<Event> event, uint32_t dailyCnt, uint32_t maxCnt);
     // Decides whether the logs of a kept event may be caught; returns the new last-log time.
     uint64_t CheckAndGetLogTime(sp<Event> event, const DomainQuota& quota, uint64_t lastLogTime);
-    int32_t CountRows(const std::string& table, EventQuery query);
+    int64_t CountRows(const std::string& table);
 
     PluginContext* context_ = nullptr;
     int32_t dbVersionRowId_ = 0;
@@ -71,6 +75,16 @@ private:
     std::string dbPath_;
     sp<EventDatabase> database_;
     LogRuleLookup logRuleLookup_;
+    // Statistics, found once in Init.
+    DaemonStats::Counter* stored_ = nullptr;
+    DaemonStats::Counter* storeFailed_ = nullptr;
+    DaemonStats::Counter* droppedOverQuota_ = nullptr;
+    DaemonStats::Counter* droppedPunished_ = nullptr;
+    DaemonStats::Counter* futureTimes_ = nullptr;
+    DaemonStats::Counter* dayStartHealed_ = nullptr;
+    DaemonStats::Counter* trimRuns_ = nullptr;
+    DaemonStats::Counter* trimRows_ = nullptr;
+    DaemonStats::Counter* vacuumSkipped_ = nullptr;
 };
 
 }  // namespace Orvane

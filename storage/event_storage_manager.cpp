@@ -1,11 +1,14 @@
 #include "storage/event_storage_manager.h"
 
+#include <fcntl.h>
 #include <stdio.h>
 #include <unistd.h>
 
-#include <chrono>
-#include <future>
 #include <memory>
+
+#include <android-base/unique_fd.h>
+#include <utils/Condition.h>
+#include <utils/Mutex.h>
 
 #include "platform/plugin_context.h"
 #include "platform/plugin_factory.h"
@@ -34,12 +37,21 @@ constexpr uint32_t kRawIdMin = 100000;
 constexpr uint32_t kRawIdMax = 199999;
 // Handed back for ids that are not stored; as a handler result it ends the pipeline.
 constexpr EVENT_RET kNotStored = static_cast<EVENT_RET>(0xFFFFFFFFu);
-// How long a dump waits for the storage loop before giving up.
-constexpr auto kDumpWait = std::chrono::seconds(10);
+// How long a dump waits for the storage loop before giving up, in nanoseconds.
+constexpr nsecs_t kDumpWaitNs = 10000000000LL;
 
 bool IsFaultId(uint32_t id) {
     return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
 }
+
+// A dump handed to the storage loop: its own copy of the caller's descriptor, which it closes when
+// done, and the flag the caller waits on.
+struct DumpTask {
+    base::unique_fd fd;
+    Mutex mutex;
+    Condition finished;
+    bool done GUARDED_BY(mutex) = false;
+};
 }  // namespace
 
 EventStorageManager::EventStorageManager() : helper_(new EventDatabaseHelper()) {}
@@ -47,13 +59,21 @@ EventStorageManager::EventStorageManager() : helper_(new EventDatabaseHelper()) 
 void EventStorageManager::OnLoad() {
     SetVersion("EventStorageManager-1.0");
     SetName("EventStorageManager");
-    helper_->Init(GetPluginContext(), kDbFileName, DevInfo::GetQuorVersion());
     sp<EventLoop> loop = GetLooper();
     if (loop == nullptr) {
+        helper_->Init(GetPluginContext(), kDbFileName, DevInfo::GetQuorVersion());
         OLOGE("%s storage manager looper not set");
         return;
     }
-    ScheduleCheck(loop, 0);
+    // The database belongs to the loop, so it is opened there, ahead of every event and check.
+    wp<EventStorageManager> weak = this;
+    loop->AddTask([weak]() {
+        sp<EventStorageManager> self = weak.promote();
+        if (self != nullptr) {
+            self->helper_->Init(self->GetPluginContext(), kDbFileName, DevInfo::GetQuorVersion());
+            self->CheckEventStore();
+        }
+    });
 }
 
 void EventStorageManager::ScheduleCheck(const sp<EventLoop>& loop, uint32_t delaySeconds) {
@@ -128,20 +148,27 @@ void EventStorageManager::Dump(int fd, const std::vector<std::string>& args) {
         return;
     }
     // The task owns a copy of the descriptor, so a dump that outlives the wait writes nowhere harmful.
-    int taskFd = dup(fd);
-    if (taskFd < 0) {
+    auto task = std::make_shared<DumpTask>();
+    task->fd.reset(fcntl(fd, F_DUPFD_CLOEXEC, 0));
+    if (task->fd < 0) {
         dprintf(fd, "dump failed\n");
         return;
     }
-    auto done = std::make_shared<std::promise<void>>();
-    std::future<void> finished = done->get_future();
     sp<EventStorageManager> self = this;
-    loop->AddTask([self, taskFd, args, done]() {
-        self->RunDump(taskFd, args);
-        close(taskFd);
-        done->set_value();
+    loop->AddTask([self, task, args]() {
+        self->RunDump(task->fd.get(), args);
+        task->fd.reset();
+        Mutex::Autolock lock(task->mutex);
+        task->done = true;
+        task->finished.signal();
     });
-    if (finished.wait_for(kDumpWait) != std::future_status::ready) {
+    Mutex::Autolock lock(task->mutex);
+    nsecs_t deadline = systemTime(SYSTEM_TIME_MONOTONIC) + kDumpWaitNs;
+    for (nsecs_t now = systemTime(SYSTEM_TIME_MONOTONIC); !task->done && now < deadline;
+         now = systemTime(SYSTEM_TIME_MONOTONIC)) {
+        task->finished.waitRelative(task->mutex, deadline - now);
+    }
+    if (!task->done) {
         OLOGW("%s storage loop busy, dump %s not done in time", args[0].c_str());
         dprintf(fd, "storage busy, try again\n");
     }

@@ -14,8 +14,9 @@ namespace Orvane {
 // The plugin that stores events: routes each event by category and id to its kind of storage,
 // checks the database size periodically and answers dump commands.
 // Threads: OnEvent and CheckEventStore run on the plugin's loop, which owns the helper and,
-// through it, the database. Dump, entered from a binder thread, runs its work as a task on that
-// loop and waits for it, so the database is never used from two threads at once.
+// through it, the database (opened there as the loop's first task). Dump, entered from a binder
+// thread, runs its work as a task on that loop and waits for it, a bounded time, so the database
+// is never used from two threads at once.
 class EventStorageManager : public Plugin {
 public:
     EventStorageManager();

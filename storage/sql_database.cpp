@@ -140,7 +140,9 @@ bool SqlDatabase::Open() {
     // Both fail harmlessly once SQLite is initialised; they matter for the first open only.
     sqlite3_config(SQLITE_CONFIG_SMALL_MALLOC, 1);
     sqlite3_soft_heap_limit64(kSoftHeapLimit);
-    if (sqlite3_open(path_.c_str(), &handle_) != SQLITE_OK) {
+    lastCode_ = sqlite3_open_v2(path_.c_str(), &handle_,
+                                SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOFOLLOW, nullptr);
+    if (lastCode_ != SQLITE_OK) {
         lastError_ = sqlite3_errmsg(handle_);
         OLOGE("%s failed open db %s, %s", path_.c_str(), lastError_.c_str());
         // A failed open still allocates a handle that must be released.
@@ -148,6 +150,7 @@ bool SqlDatabase::Open() {
         handle_ = nullptr;
         return false;
     }
+    sqlite3_busy_timeout(handle_, kBusyTimeoutMs);
     if (!Execute("PRAGMA cache_size=10;", false)) {
         OLOGE("%s failed db %s set cache size, %s", path_.c_str(), lastError_.c_str());
     }
@@ -164,6 +167,7 @@ void SqlDatabase::Close() {
     }
     sqlite3_close(handle_);
     lastError_.clear();
+    lastCode_ = SQLITE_OK;
     results_.clear();
     handle_ = nullptr;
 }
@@ -172,13 +176,14 @@ bool SqlDatabase::Execute(const std::string& sql, bool wantRows) {
     lastError_.clear();
     results_.clear();
     if (handle_ == nullptr) {
+        lastCode_ = SQLITE_MISUSE;
         return false;
     }
     OLOGD("%s start execute sql %s:%s", path_.c_str(), sql.c_str());
     char* error = nullptr;
-    int ret = sqlite3_exec(handle_, sql.c_str(), wantRows ? &SqlDatabase::GetExecResult : nullptr,
-                           wantRows ? this : nullptr, &error);
-    if (ret == SQLITE_OK) {
+    lastCode_ = sqlite3_exec(handle_, sql.c_str(), wantRows ? &SqlDatabase::GetExecResult : nullptr,
+                             wantRows ? this : nullptr, &error);
+    if (lastCode_ == SQLITE_OK) {
         return true;
     }
     if (error != nullptr) {
@@ -188,10 +193,18 @@ bool SqlDatabase::Execute(const std::string& sql, bool wantRows) {
     return false;
 }
 
+bool SqlDatabase::LastFailureIsCorruption() const {
+    return lastCode_ == SQLITE_CORRUPT || lastCode_ == SQLITE_NOTADB;
+}
+
+int64_t SqlDatabase::GetChanges() const {
+    return handle_ == nullptr ? 0 : sqlite3_changes(handle_);
+}
+
 bool SqlDatabase::ExecuteSql(const std::string& sql) {
     bool ok = Execute(sql, false);
     if (!ok) {
-        OLOGW("%s failed execute sql %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
+        OLOGW_LIMITED("%s failed execute sql %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
     }
     return ok;
 }
@@ -222,7 +235,7 @@ std::vector<SqlRow> SqlDatabase::QueryRecord(const std::string& sql, const std::
     }
     expectedFieldNames_ = fieldNames;
     if (!Execute(sql, true)) {
-        OLOGE("%s failed QueryRecord %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
+        OLOGE_LIMITED("%s failed QueryRecord %s, err:%s, sql:%s", path_.c_str(), lastError_.c_str(), sql.c_str());
     }
     expectedFieldNames_.clear();
     return results_;
@@ -233,7 +246,7 @@ bool SqlDatabase::TruncateTable(const std::string& table) {
         return false;
     }
     if (!Execute("delete from " + table, false)) {
-        OLOGW("%s failed truncate table %s:%s, %s", path_.c_str(), table.c_str(), lastError_.c_str());
+        OLOGW_LIMITED("%s failed truncate table %s:%s, %s", path_.c_str(), table.c_str(), lastError_.c_str());
         return false;
     }
     Execute("DELETE FROM sqlite_sequence WHERE name='" + table + "'", false);

@@ -76,8 +76,13 @@ private:
 // loop serialises them).
 class SqlDatabase : public RefBase {
 public:
+    // How long a statement waits for another connection's lock (a reader such as a shell or a
+    // backup) before it fails with "database is locked".
+    static constexpr int kBusyTimeoutMs = 10000;
+
     explicit SqlDatabase(const std::string& path) : path_(path) {}
 
+    // Opens read-write, creating the file; a path through a symbolic link is not opened.
     bool Open();
     void Close();
     bool Execute(const std::string& sql, bool wantRows);
@@ -89,6 +94,12 @@ public:
 
     const std::string& GetPath() const { return path_; }
     const std::string& GetLastError() const { return lastError_; }
+    // SQLite's result code of the last open or statement.
+    int GetLastCode() const { return lastCode_; }
+    // True when the last open or statement found that the file is no database or is damaged.
+    bool LastFailureIsCorruption() const;
+    // Rows changed by the last statement.
+    int64_t GetChanges() const;
     bool IsOpen() const { return handle_ != nullptr; }
 
     // Row callback of sqlite3_exec; `context` is the database that runs the query.
@@ -99,6 +110,7 @@ private:
     sqlite3* handle_ = nullptr;
     std::string path_;
     std::string lastError_;
+    int lastCode_ = 0;
     std::vector<SqlRow> results_;
 };
 

@@ -37,7 +37,7 @@ std::string DevInfo::GetUploadSwitch() {
 
 bool DevInfo::SetUploadSwitch(int value) {
     if (value < 0 || value > 2) {
-        OLOGE("%s invalid upload switch %d", value);
+        OLOGE_LIMITED("%s invalid upload switch %d", value);
         return false;
     }
     return SysEnv::SetSysProperity(kUploadSwitchKey, std::to_string(value));

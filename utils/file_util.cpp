@@ -1,12 +1,16 @@
 #include "utils/file_util.h"
 
 #include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+
+#include <android-base/file.h>
+#include <android-base/unique_fd.h>
 
 #include "utils/orvane_log.h"
 #include "utils/string_util.h"
@@ -22,7 +26,7 @@ constexpr int64_t kMaxLoadBytes = 32 * 1024 * 1024;
 int64_t StatSize(const std::string& path) {
     struct stat st;
     if (stat(path.c_str(), &st) != 0) {
-        OLOG_AS(ANDROID_LOG_INFO, "GetFileSize", "%s errno %d,err %s", errno, strerror(errno));
+        OLOG_LIMITED_AS(ANDROID_LOG_INFO, "GetFileSize", "%s errno %d,err %s", errno, strerror(errno));
         return 0;
     }
     return st.st_size;
@@ -43,8 +47,8 @@ int32_t DeleteEntries(DIR* dir, const std::string& path, uint64_t& total) {
         // lstat: a link to a folder elsewhere is removed as a link, never followed into.
         struct stat st;
         if (lstat(entryPath.c_str(), &st) != 0) {
-            OLOG_AS(ANDROID_LOG_ERROR, "DeleteDirectoryOrFile", "%s stat %s failed, errno:%d, err:%s",
-                    entryPath.c_str(), errno, strerror(errno));
+            OLOG_LIMITED_AS(ANDROID_LOG_ERROR, "DeleteDirectoryOrFile", "%s stat %s failed, errno:%d, err:%s",
+                            entryPath.c_str(), errno, strerror(errno));
             return -1;
         }
         if (S_ISDIR(st.st_mode)) {
@@ -58,8 +62,8 @@ int32_t DeleteEntries(DIR* dir, const std::string& path, uint64_t& total) {
         }
         total += st.st_size;
         if (unlink(entryPath.c_str()) != 0) {
-            OLOG_AS(ANDROID_LOG_ERROR, "DeleteDirectoryOrFile", "%s unlink %s failed, errno:%d, err:%s",
-                    entryPath.c_str(), errno, strerror(errno));
+            OLOG_LIMITED_AS(ANDROID_LOG_ERROR, "DeleteDirectoryOrFile", "%s unlink %s failed, errno:%d, err:%s",
+                            entryPath.c_str(), errno, strerror(errno));
             return -1;
         }
     }
@@ -87,7 +91,7 @@ bool CreateDirectory(const std::string& path, mode_t mode) {
             if (errno == EEXIST) {  // another thread or process was first; not ours to change
                 continue;
             }
-            OLOGE("%s mkdir %s failed, %s, err:%s", prefix.c_str(), path.c_str(), strerror(errno));
+            OLOGE_LIMITED("%s mkdir %s failed, %s, err:%s", prefix.c_str(), path.c_str(), strerror(errno));
             return false;
         }
         if (firstCreated == 0) {
@@ -101,7 +105,7 @@ bool CreateDirectory(const std::string& path, mode_t mode) {
     for (size_t end = work.size() - 1; end >= firstCreated; end = work.rfind('/', end - 1)) {
         const std::string dir = work.substr(0, end);
         if (!FileExists(dir) || chmod(dir.c_str(), mode) != 0) {
-            OLOGE("%s change mode %s failed", dir.c_str());
+            OLOGE_LIMITED("%s change mode %s failed", dir.c_str());
             return false;
         }
     }
@@ -141,30 +145,32 @@ int64_t GetFileSize(const std::string& path) {
 }
 
 bool LoadStringFromFile(const std::string& path, std::string& content) {
-    FILE* file = fopen(path.c_str(), "rb");
-    if (file == nullptr) {
-        OLOGE("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+    // Close-on-exec, as every descriptor of the daemon: the command runner's children must not
+    // inherit it.
+    android::base::unique_fd fd(TEMP_FAILURE_RETRY(open(path.c_str(), O_RDONLY | O_CLOEXEC)));
+    if (fd < 0) {
+        OLOGE_LIMITED("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
         return false;
     }
-    if (fseeko(file, 0, SEEK_END) != 0 || ftello(file) > kMaxLoadBytes) {
-        OLOGE("%s %s is over %lld bytes or cannot be measured", path.c_str(), static_cast<long long>(kMaxLoadBytes));
-        fclose(file);
+    // Measured with fstat: files of /proc (seq files) refuse a seek to their end.
+    struct stat st;
+    if (fstat(fd, &st) != 0 || st.st_size > kMaxLoadBytes) {
+        OLOGE_LIMITED("%s %s is over %lld bytes or cannot be measured", path.c_str(),
+                      static_cast<long long>(kMaxLoadBytes));
         return false;
     }
-    rewind(file);
     // Read to the end rather than to the measured size: files of /proc measure 0 bytes, and a
     // file may grow while it is read. The limit holds for what is actually read.
     std::string text;
     char buffer[16 * 1024];
-    size_t got;
-    while ((got = fread(buffer, 1, sizeof(buffer), file)) > 0 &&
+    ssize_t got;
+    while ((got = TEMP_FAILURE_RETRY(read(fd, buffer, sizeof(buffer)))) > 0 &&
            text.size() + got <= static_cast<size_t>(kMaxLoadBytes)) {
         text.append(buffer, got);
     }
-    bool ok = got == 0 && ferror(file) == 0;
-    fclose(file);
-    if (!ok) {
-        OLOGE("%s read %s failed or it grew over %lld bytes", path.c_str(), static_cast<long long>(kMaxLoadBytes));
+    if (got != 0) {
+        OLOGE_LIMITED("%s read %s failed or it grew over %lld bytes", path.c_str(),
+                      static_cast<long long>(kMaxLoadBytes));
         return false;
     }
     content = StringUtil::TrimStr(text, '\0');
@@ -175,32 +181,34 @@ bool SaveStringToFile(const std::string& path, const std::string& content, bool 
     if (content.empty()) {
         return true;
     }
-    FILE* file = fopen(path.c_str(), truncate ? "w" : "a");
-    if (file == nullptr) {
-        OLOGE("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+    int flags = O_WRONLY | O_CREAT | O_CLOEXEC | (truncate ? O_TRUNC : O_APPEND);
+    android::base::unique_fd fd(TEMP_FAILURE_RETRY(open(path.c_str(), flags, 0666)));
+    if (fd < 0) {
+        OLOGE_LIMITED("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
         return false;
     }
-    bool ok = fwrite(content.data(), 1, content.size(), file) == content.size();
-    ok = fclose(file) == 0 && ok;
-    if (!ok) {
-        OLOGE("%s write %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+    // A failed close can be the first report of a failed write.
+    if (!android::base::WriteStringToFd(content, fd) || close(fd.release()) != 0) {
+        OLOGE_LIMITED("%s write %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+        return false;
     }
-    return ok;
+    return true;
 }
 
 void DeleteFile(const std::string& path) {
     if (!FileExists(path)) {
-        OLOGE("%s  file not exist %s", path.c_str());
+        OLOGE_LIMITED("%s  file not exist %s", path.c_str());
         return;
     }
     if (remove(path.c_str()) != 0) {
-        OLOGE("%s remove file %s errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+        OLOGE_LIMITED("%s remove file %s errno:%d, err:%s", path.c_str(), errno, strerror(errno));
     }
 }
 
 bool MoveFile(const std::string& oldPath, const std::string& newPath) {
     if (rename(oldPath.c_str(), newPath.c_str()) != 0) {
-        OLOGE("%s move file %s to %s failed, err:%d, %s", oldPath.c_str(), newPath.c_str(), errno, strerror(errno));
+        OLOGE_LIMITED("%s move file %s to %s failed, err:%d, %s", oldPath.c_str(), newPath.c_str(), errno,
+                      strerror(errno));
         return false;
     }
     return true;
@@ -214,12 +222,12 @@ int32_t DeleteDirectoryOrFile(const std::string& path, uint64_t& total, bool rem
     DIR* dir = opendir(path.c_str());
     if (dir == nullptr) {
         if (errno != ENOTDIR) {
-            OLOGE("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+            OLOGE_LIMITED("%s open %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
             return -1;
         }
         total = static_cast<uint64_t>(StatSize(path));
         if (unlink(path.c_str()) != 0) {
-            OLOGE("%s unlink %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+            OLOGE_LIMITED("%s unlink %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
             return -1;
         }
         return 0;
@@ -234,7 +242,7 @@ int32_t DeleteDirectoryOrFile(const std::string& path, uint64_t& total, bool rem
         total += st.st_size;
     }
     if (removeSelf && rmdir(path.c_str()) != 0) {
-        OLOGE("%s rmdir %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
+        OLOGE_LIMITED("%s rmdir %s failed, errno:%d, err:%s", path.c_str(), errno, strerror(errno));
         return -1;
     }
     return 0;

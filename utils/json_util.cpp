@@ -14,7 +14,7 @@ bool ConvertStrToJson(const std::string& text, Json::Value& out) {
     std::string errors;
     bool parsed = reader->parse(text.data(), text.data() + text.size(), &out, &errors);
     if (!errors.empty()) {
-        OLOGE("%s json convert failed %s", errors.c_str());
+        OLOGE_LIMITED("%s json convert failed %s", errors.c_str());
     }
     return parsed && errors.empty();
 }

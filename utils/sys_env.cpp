@@ -4,7 +4,7 @@
 #include "utils/string_util.h"
 
 #if defined(__ANDROID__)
-#include <cutils/properties.h>
+#include <android-base/properties.h>
 #endif
 
 namespace android {
@@ -33,19 +33,17 @@ bool SysEnv::CheckProperty(const std::string& key, const std::string& value) {
 
 #if defined(__ANDROID__)
 
+// An empty or unset property reads as the default, as property_get gives it.
 std::string SysEnv::GetSysProperity(const std::string& key, const std::string& defaultValue) {
-    char value[PROPERTY_VALUE_MAX] = {0};
-    property_get(key.c_str(), value, defaultValue.c_str());
-    return value;
+    return android::base::GetProperty(key, defaultValue);
 }
 
 bool SysEnv::SetSysProperity(const std::string& key, const std::string& value) {
     if (!CheckProperty(key, value)) {
         return false;
     }
-    int ret = property_set(key.c_str(), value.c_str());
-    if (ret != 0) {
-        OLOGE("%s property_set %s failed, ret=%d", key.c_str(), ret);
+    if (!android::base::SetProperty(key, value)) {
+        OLOGE("%s property_set %s failed", key.c_str());
         return false;
     }
     return true;

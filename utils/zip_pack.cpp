@@ -5,7 +5,6 @@
 #include <zlib.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <cstring>
 #include <ctime>
 
@@ -48,7 +47,7 @@ bool ZipBase::OpenNewFileInZip(zipFile zipHandle, const std::string& entryName) 
                                    Z_DEFAULT_COMPRESSION, 0, -MAX_WBITS, kMemLevel, Z_DEFAULT_STRATEGY, nullptr, 0, 0,
                                    kUtf8NameFlag);
     if (ret != ZIP_OK) {
-        OLOGE("%s zipOpenNewFileInZip4 failed");
+        OLOGE_LIMITED("%s zipOpenNewFileInZip4 failed");
         return false;
     }
     return true;
@@ -65,15 +64,17 @@ ZipPack::~ZipPack() {
 
 bool ZipPack::CreateZip(const std::string& path) {
     Close();
+    owner_.Check(__func__);
     zipHandle_ = OpenZip(path, APPEND_STATUS_CREATE);
     if (zipHandle_ == nullptr) {
-        OLOGE("%s Couldn't create ZIP file at path %s %p", path.c_str(), zipHandle_);
+        OLOGE_LIMITED("%s Couldn't create ZIP file at path %s %p", path.c_str(), zipHandle_);
         return false;
     }
     return true;
 }
 
 bool ZipPack::AddFiles(const std::vector<std::string>& paths) {
+    owner_.Check(__func__);
     if (zipHandle_ == nullptr) {
         return false;
     }
@@ -82,6 +83,7 @@ bool ZipPack::AddFiles(const std::vector<std::string>& paths) {
 }
 
 bool ZipPack::FlushFilesIfNeeded(bool force) {
+    owner_.Check(__func__);
     if (pending_.size() < kBatchSize && !force) {
         return true;
     }
@@ -126,15 +128,16 @@ bool ZipPack::AddFileContentToZip(const std::string& path) {
     if (!FileUtil::FileExists(path)) {
         return false;
     }
-    android::base::unique_fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    android::base::unique_fd fd(TEMP_FAILURE_RETRY(open(path.c_str(), O_RDONLY | O_CLOEXEC)));
     if (fd < 0) {
-        OLOGI("%s open file %s failed", path.c_str());
+        OLOGI_LIMITED("%s open file %s failed", path.c_str());
         return false;
     }
     return CopyToEntry(fd.get(), path);
 }
 
 bool ZipPack::AddFileFromFd(int fd, const std::string& entryName, uint64_t maxBytes) {
+    owner_.Check(__func__);
     if (zipHandle_ == nullptr || fd < 0 || !OpenNewFileInZip(zipHandle_, entryName)) {
         return false;
     }
@@ -152,11 +155,12 @@ bool ZipPack::CopyToEntry(int fd, const std::string& what, uint64_t maxBytes) {
         }
         if (n < 0) {
             // A read error never turns into end of file; keep what was copied so far.
-            OLOGI("%s read file %s failed", what.c_str());
+            OLOG_LIMITED_AS(ANDROID_LOG_INFO, "AddFileContentToZip", "%s read file %s failed", what.c_str());
             return false;
         }
         if (zipWriteInFileInZip(zipHandle_, buffer, static_cast<unsigned>(n)) != ZIP_OK) {
-            OLOGI("%s Could not write data to zip for path:%s ", what.c_str());
+            OLOG_LIMITED_AS(ANDROID_LOG_INFO, "AddFileContentToZip", "%s Could not write data to zip for path:%s ",
+                            what.c_str());
             return false;
         }
         maxBytes -= static_cast<uint64_t>(n);
@@ -165,16 +169,19 @@ bool ZipPack::CopyToEntry(int fd, const std::string& what, uint64_t maxBytes) {
 }
 
 void ZipPack::Close() {
+    owner_.Check(__func__);
     if (zipHandle_ == nullptr) {
+        owner_.Detach();
         return;
     }
     if (!FlushFilesIfNeeded(true)) {
-        OLOGE("%s force flush files failed");
+        OLOGE_LIMITED("%s force flush files failed");
     }
     if (zipClose(zipHandle_, nullptr) != ZIP_OK) {
-        OLOGE("%s close zip file failed");
+        OLOGE_LIMITED("%s close zip file failed");
     }
     zipHandle_ = nullptr;
+    owner_.Detach();
 }
 
 ZipReader::~ZipReader() {
@@ -182,18 +189,19 @@ ZipReader::~ZipReader() {
 }
 
 bool ZipReader::Open(const std::string& path) {
+    owner_.Check(__func__);
     if (unzHandle_ != nullptr) {
         OLOGD("%s unzip file already exist %s", path.c_str());
         return false;
     }
     unzHandle_ = OpenForUnzip(path);
     if (unzHandle_ == nullptr) {
-        OLOGI("%s unzip file failed %s", path.c_str());
+        OLOGI_LIMITED("%s unzip file failed %s", path.c_str());
         return false;
     }
     unz_global_info globalInfo = {};
     if (unzGetGlobalInfo(unzHandle_, &globalInfo) != UNZ_OK) {
-        OLOG_AS(ANDROID_LOG_INFO, "OpenInternal", "%s open unzip internal file get Global info failed");
+        OLOG_LIMITED_AS(ANDROID_LOG_INFO, "OpenInternal", "%s open unzip internal file get Global info failed");
         return false;
     }
     entryCount_ = static_cast<int32_t>(globalInfo.number_entry);
@@ -205,12 +213,13 @@ bool ZipReader::Open(const std::string& path) {
 }
 
 bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t bufferSize, const Consumer& consumer) {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
         return false;
     }
     if (!atFirstEntry_) {
         if (unzGoToFirstFile(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file goto first failed %s", entryName.c_str());
+            OLOGI_LIMITED("%s unzip file goto first failed %s", entryName.c_str());
             return false;
         }
         atFirstEntry_ = true;
@@ -222,7 +231,7 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
         char name[kNameBufferSize + 1] = {};  // one spare byte keeps a full-length name terminated
         unz_file_info info = {};
         if (unzGetCurrentFileInfo(unzHandle_, &info, name, kNameBufferSize, nullptr, 0, nullptr, 0) != UNZ_OK) {
-            OLOGI("%s get zip file info failed %s", entryName.c_str());
+            OLOGI_LIMITED("%s get zip file info failed %s", entryName.c_str());
             return false;
         }
         if (info.size_filename < kNameBufferSize && info.size_filename == entryName.size() &&
@@ -231,7 +240,7 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
         }
         if (i < entryCount_ - 1) {
             if (unzGoToNextFile(unzHandle_) != UNZ_OK) {
-                OLOGI("%s goto next file info failed %s", name);
+                OLOGI_LIMITED("%s goto next file info failed %s", name);
             }
             atFirstEntry_ = false;
         }
@@ -240,11 +249,12 @@ bool ZipReader::ExtractFile(const std::string& entryName, char* buffer, uint32_t
 }
 
 bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consumer& consumer) {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
         return false;
     }
     if (unzOpenCurrentFile(unzHandle_) != UNZ_OK) {
-        OLOGI("%s open current unzip file info failed");
+        OLOGI_LIMITED("%s open current unzip file info failed");
         return false;
     }
     while (true) {
@@ -254,7 +264,7 @@ bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consume
             break;
         }
         if (n < 0) {
-            OLOGI("%s read unzip file info failed %d", n);
+            OLOGI_LIMITED("%s read unzip file info failed %d", n);
             break;
         }
         if (n == 0) {
@@ -262,28 +272,31 @@ bool ZipReader::ReadFileContent(char* buffer, uint32_t bufferSize, const Consume
         }
     }
     if (unzCloseCurrentFile(unzHandle_) != UNZ_OK) {
-        OLOGI("%s close current unzip file failed");
+        OLOGI_LIMITED("%s close current unzip file failed");
         return false;
     }
     return true;
 }
 
 void ZipReader::Close() {
+    owner_.Check(__func__);
     if (unzHandle_ == nullptr) {
+        owner_.Detach();
         return;
     }
     if (unzClose(unzHandle_) != UNZ_OK) {
         if (unzGoToFirstFile(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file goto first failed ");
+            OLOGI_LIMITED("%s unzip file goto first failed ");
             return;
         }
         if (unzClose(unzHandle_) != UNZ_OK) {
-            OLOGI("%s unzip file close failed");
+            OLOGI_LIMITED("%s unzip file close failed");
         }
     }
     unzHandle_ = nullptr;
     entryCount_ = 0;
     atFirstEntry_ = true;
+    owner_.Detach();
 }
 
 }  // namespace Orvane

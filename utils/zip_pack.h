@@ -10,6 +10,8 @@
 #include <string>
 #include <vector>
 
+#include "utils/thread_checker.h"
+
 namespace android {
 namespace Orvane {
 
@@ -33,7 +35,8 @@ protected:
 // Writes a zip archive from lists of files and folders: CreateZip, AddFiles (any number of
 // times), Close. Files are written in batches of 50; the remainder only on Close, so a pack
 // destroyed without Close leaves its pending paths out of the archive.
-// Not thread-safe: one owner thread drives an instance from creation to Close.
+// Not thread-safe: one owner thread drives an instance from creation to Close (checked), after
+// which another may take it over.
 class ZipPack : public ZipBase {
 public:
     ZipPack() = default;
@@ -65,12 +68,13 @@ private:
     // log lines.
     bool CopyToEntry(int fd, const std::string& what, uint64_t maxBytes = UINT64_MAX);
 
+    ThreadChecker owner_;
     zipFile zipHandle_ = nullptr;
     std::deque<std::string> pending_;
 };
 
 // Finds one entry of an existing archive and streams it to a caller's function: Open, any
-// number of ExtractFile, Close. Not thread-safe: one owner thread per instance.
+// number of ExtractFile, Close. Not thread-safe: one owner thread from Open to Close (checked).
 class ZipReader : public ZipBase {
 public:
     // Called for every read of an entry with (buffer, buffer size, bytes read); bytes read is 0
@@ -91,6 +95,7 @@ public:
 private:
     static constexpr size_t kNameBufferSize = 256;
 
+    ThreadChecker owner_;
     unzFile unzHandle_ = nullptr;
     int32_t entryCount_ = 0;
     bool atFirstEntry_ = true;

@@ -21,14 +21,6 @@ size_t PadSize(size_t size) {
 
 }  // namespace
 
-Parcel::~Parcel() {
-    if (ownsFds_) {
-        for (int fd : fds_) {
-            close(fd);
-        }
-    }
-}
-
 void Parcel::setDataPosition(size_t position) const {
     position_ = position > data_.size() ? data_.size() : position;
 }
@@ -47,14 +39,12 @@ status_t Parcel::setData(const uint8_t* buffer, size_t length) {
     return OK;
 }
 
-void Parcel::adoptFileDescriptors(std::vector<int> fds) {
-    if (ownsFds_) {
-        for (int fd : fds_) {
-            close(fd);
-        }
+void Parcel::adoptFileDescriptors(std::vector<android::base::unique_fd> fds) {
+    ownedFds_ = std::move(fds);
+    fds_.clear();
+    for (const auto& fd : ownedFds_) {
+        fds_.push_back(fd.get());
     }
-    fds_ = std::move(fds);
-    ownsFds_ = true;
 }
 
 status_t Parcel::Append(const void* bytes, size_t length) {

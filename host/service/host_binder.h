@@ -13,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include <android-base/unique_fd.h>
 #include <utils/Errors.h>
 #include <utils/RefBase.h>
 #include <utils/String16.h>
@@ -27,7 +28,6 @@ namespace Orvane {
 class Parcel {
 public:
     Parcel() = default;
-    ~Parcel();
     Parcel(const Parcel&) = delete;
     Parcel& operator=(const Parcel&) = delete;
 
@@ -38,7 +38,7 @@ public:
     void setDataPosition(size_t position) const;
     status_t setDataSize(size_t size);
     status_t setData(const uint8_t* buffer, size_t length);
-    void adoptFileDescriptors(std::vector<int> fds);
+    void adoptFileDescriptors(std::vector<android::base::unique_fd> fds);
     // Descriptors written with writeFileDescriptor, to be sent alongside the bytes.
     const std::vector<int>& fileDescriptors() const { return fds_; }
 
@@ -68,7 +68,7 @@ private:
     std::vector<uint8_t> data_;
     mutable size_t position_ = 0;
     std::vector<int> fds_;
-    bool ownsFds_ = false;
+    std::vector<android::base::unique_fd> ownedFds_;
 };
 
 namespace binder {

@@ -11,9 +11,13 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <iterator>
+
+#include <android-base/cmsg.h>
 
 #include "utils/orvane_log.h"
 
@@ -27,7 +31,10 @@ DecodeResult DecodeRequest(const uint8_t* bytes, size_t length, RequestHeader* h
         return DecodeResult::kIncomplete;
     }
     memcpy(header, bytes, kRequestHeaderSize);
-    if (header->size > kMaxDataSize || header->size % 4 != 0) {
+    if (header->size > kMaxDataSize) {
+        return DecodeResult::kOversized;
+    }
+    if (header->size % 4 != 0) {
         return DecodeResult::kMalformed;
     }
     return length - kRequestHeaderSize >= header->size ? DecodeResult::kComplete : DecodeResult::kIncomplete;
@@ -37,19 +44,16 @@ DecodeResult DecodeRequest(const uint8_t* bytes, size_t length, RequestHeader* h
 
 namespace {
 
+using android::base::ReceiveFileDescriptorVector;
+using android::base::SendFileDescriptorVector;
+using android::base::unique_fd;
 using Clock = std::chrono::steady_clock;
 using HostBinderFrame::DecodeResult;
 
 constexpr uint64_t kWakeId = 0;
 constexpr uint64_t kServiceTag = 1ULL << 63;
 constexpr int kListenBacklog = 128;
-
-void CloseAll(std::vector<int>& fds) {
-    for (int fd : fds) {
-        close(fd);
-    }
-    fds.clear();
-}
+constexpr mode_t kSocketMode = 0660;
 
 // Writes everything or gives up after timeoutMs without progress.
 bool WriteAll(int fd, const uint8_t* bytes, size_t length, int timeoutMs) {
@@ -74,85 +78,118 @@ bool WriteAll(int fd, const uint8_t* bytes, size_t length, int timeoutMs) {
     return true;
 }
 
+// Makes room for a new socket at path: nothing there, or a socket left by an earlier run, which
+// is removed. Anything else may belong to someone else and is neither followed nor removed.
+bool ClearSocketPath(const std::string& path) {
+    struct stat st = {};
+    if (lstat(path.c_str(), &st) != 0) {
+        if (errno == ENOENT) {
+            return true;
+        }
+        OLOG_AS(ANDROID_LOG_ERROR, "AddService", "%s cannot check %s: %s", path.c_str(), strerror(errno));
+        return false;
+    }
+    if (!S_ISSOCK(st.st_mode)) {
+        OLOG_AS(ANDROID_LOG_ERROR, "AddService", "%s %s is not a socket, refusing to replace it", path.c_str());
+        return false;
+    }
+    if (unlink(path.c_str()) != 0) {
+        OLOG_AS(ANDROID_LOG_ERROR, "AddService", "%s cannot remove the old socket %s: %s", path.c_str(),
+                strerror(errno));
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
 struct HostBinderServer::Connection {
-    int fd = -1;
+    unique_fd fd;
     sp<BBinder> binder;
     uid_t uid = 0;
     pid_t pid = 0;
+    // Guarded by the server's mutex_.
     bool busy = false;
     Clock::time_point lastActive;
+    // Only for the thread serving the connection: the bytes of the requests being read, and the
+    // descriptors that came with them.
     std::vector<uint8_t> buffer;
-    std::vector<int> fds;  // received with the bytes of the request being read
-
-    ~Connection() {
-        CloseAll(fds);
-        if (fd >= 0) {
-            close(fd);
-        }
-    }
+    std::vector<unique_fd> fds;
 };
 
-HostBinderServer::HostBinderServer() : HostBinderServer(Options()) {}
+HostBinderServer::HostBinderServer(DaemonStats& stats) : HostBinderServer(stats, Options()) {}
 
-HostBinderServer::HostBinderServer(const Options& options)
-    : options_(options), epollFd_(epoll_create1(EPOLL_CLOEXEC)), wakeFd_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
-    if (epollFd_ < 0 || wakeFd_ < 0) {
+HostBinderServer::HostBinderServer(DaemonStats& stats, const Options& options)
+    : options_(options),
+      epollFd_(epoll_create1(EPOLL_CLOEXEC)),
+      wakeFd_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
+      badFrames_(stats.Get("service.host.bad_frames")),
+      oversizedRequests_(stats.Get("service.host.oversized_requests")),
+      idleTimeouts_(stats.Get("service.host.idle_timeouts")),
+      pushedOut_(stats.Get("service.host.pushed_out")),
+      refusedConnections_(stats.Get("service.host.refused_connections")),
+      repliesNotTaken_(stats.Get("service.host.replies_not_taken")) {
+    if (!epollFd_.ok() || !wakeFd_.ok()) {
         OLOGE("%s epoll or eventfd failed: %s", strerror(errno));
         return;
     }
     struct epoll_event ev = {};
     ev.events = EPOLLIN;
     ev.data.u64 = kWakeId;
-    epoll_ctl(epollFd_, EPOLL_CTL_ADD, wakeFd_, &ev);
+    epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, wakeFd_.get(), &ev);
 }
 
 HostBinderServer::~HostBinderServer() {
     Stop();
-    if (epollFd_ >= 0) {
-        close(epollFd_);
-    }
-    if (wakeFd_ >= 0) {
-        close(wakeFd_);
-    }
 }
 
 bool HostBinderServer::AddService(const std::string& socketPath, const sp<BBinder>& service) {
     struct sockaddr_un addr = {};
     addr.sun_family = AF_UNIX;
-    if (epollFd_ < 0 || service == nullptr || socketPath.size() >= sizeof(addr.sun_path)) {
+    if (!epollFd_.ok() || service == nullptr) {
         OLOGE("%s cannot serve on %s", socketPath.c_str());
         return false;
     }
+    if (socketPath.size() >= sizeof(addr.sun_path)) {
+        OLOGE("%s socket path %s is longer than %zu bytes", socketPath.c_str(), sizeof(addr.sun_path) - 1);
+        return false;
+    }
+    if (!ClearSocketPath(socketPath)) {
+        return false;
+    }
     memcpy(addr.sun_path, socketPath.c_str(), socketPath.size());
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-    if (fd < 0) {
-        OLOGE("%s socket failed: %s", strerror(errno));
-        return false;
-    }
-    unlink(socketPath.c_str());
-    if (bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0 ||
-        chmod(socketPath.c_str(), 0660) != 0 || listen(fd, kListenBacklog) != 0) {
+    unique_fd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+    // The mode given to the socket before bind is the file's from its first moment (less the
+    // umask), so no caller outside the group can connect in between; the chmod after undoes a
+    // narrower umask without following a link that may have taken the socket's place.
+    if (!fd.ok() || fchmod(fd.get(), kSocketMode) != 0 ||
+        bind(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
         OLOGE("%s listen on %s failed: %s", socketPath.c_str(), strerror(errno));
-        close(fd);
         return false;
     }
-    struct epoll_event ev = {};
-    ev.events = EPOLLIN;
-    ev.data.u64 = kServiceTag | services_.size();
-    if (epoll_ctl(epollFd_, EPOLL_CTL_ADD, fd, &ev) != 0) {
-        OLOGE("%s epoll_ctl failed: %s", strerror(errno));
-        close(fd);
+    if (fchmodat(AT_FDCWD, socketPath.c_str(), kSocketMode, AT_SYMLINK_NOFOLLOW) != 0 ||
+        listen(fd.get(), kListenBacklog) != 0) {
+        OLOGE("%s listen on %s failed: %s", socketPath.c_str(), strerror(errno));
         unlink(socketPath.c_str());
         return false;
     }
-    services_.push_back({fd, socketPath, service});
+    Mutex::Autolock lock(mutex_);
+    // In the table before epoll can report it, as serving threads may already be waiting.
+    services_.push_back({socketPath, service, std::move(fd)});
+    struct epoll_event ev = {};
+    ev.events = EPOLLIN;
+    ev.data.u64 = kServiceTag | (services_.size() - 1);
+    if (epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, services_.back().fd.get(), &ev) != 0) {
+        OLOGE("%s epoll_ctl failed: %s", strerror(errno));
+        unlink(socketPath.c_str());
+        services_.pop_back();
+        return false;
+    }
     return true;
 }
 
 void HostBinderServer::StartThreadPool(size_t threads) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     for (size_t i = 0; i < threads; ++i) {
         ++runningLoops_;
         pool_.emplace_back([this] {
@@ -164,7 +201,7 @@ void HostBinderServer::StartThreadPool(size_t threads) {
 
 void HostBinderServer::JoinThreadPool() {
     {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         ++runningLoops_;
     }
     ServeLoop();
@@ -174,24 +211,25 @@ void HostBinderServer::Stop() {
     if (stopping_.exchange(true)) {
         return;
     }
-    if (wakeFd_ >= 0) {
+    if (wakeFd_.ok()) {
         uint64_t one = 1;
         // Left unread, so that the level-triggered event wakes every serving thread.
-        (void)!write(wakeFd_, &one, sizeof(one));
+        (void)!write(wakeFd_.get(), &one, sizeof(one));
     }
     std::vector<std::thread> pool;
     {
-        std::unique_lock<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         pool.swap(pool_);
     }
     for (auto& thread : pool) {
         thread.join();
     }
-    std::unique_lock<std::mutex> lock(mutex_);
-    loopsEnded_.wait(lock, [this] { return runningLoops_ == 0; });
+    Mutex::Autolock lock(mutex_);
+    while (runningLoops_ > 0) {
+        loopsEnded_.wait(mutex_);
+    }
     connections_.clear();
-    for (auto& service : services_) {
-        close(service.fd);
+    for (const auto& service : services_) {
         unlink(service.path.c_str());
     }
     services_.clear();
@@ -201,7 +239,7 @@ void HostBinderServer::ServeLoop() {
     const int sweepMs = options_.idleTimeoutMs / 5 > 10 ? options_.idleTimeoutMs / 5 : 10;
     while (!stopping_) {
         struct epoll_event ev = {};
-        int n = epoll_wait(epollFd_, &ev, 1, sweepMs);
+        int n = epoll_wait(epollFd_.get(), &ev, 1, sweepMs);
         if (n < 0 && errno != EINTR) {
             OLOGE("%s epoll_wait failed: %s", strerror(errno));
             break;
@@ -216,41 +254,48 @@ void HostBinderServer::ServeLoop() {
             HandleConnection(ev.data.u64);
         }
     }
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     if (--runningLoops_ == 0) {
-        loopsEnded_.notify_all();
+        loopsEnded_.broadcast();
     }
 }
 
 void HostBinderServer::Accept(size_t serviceIndex) {
-    const Service& service = services_[serviceIndex];
-    int fd = accept4(service.fd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
-    if (fd < 0) {
+    int listenFd;
+    std::string path;
+    auto conn = std::make_shared<Connection>();
+    {
+        Mutex::Autolock lock(mutex_);
+        const Service& service = services_[serviceIndex];
+        listenFd = service.fd.get();
+        path = service.path;
+        conn->binder = service.binder;
+    }
+    conn->fd.reset(accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+    if (!conn->fd.ok()) {
         return;  // another thread took it
     }
-    auto conn = std::make_shared<Connection>();
-    conn->fd = fd;
-    conn->binder = service.binder;
     conn->lastActive = Clock::now();
     struct ucred cred = {};
     socklen_t credLength = sizeof(cred);
-    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &credLength) != 0) {
-        OLOGW("%s no peer credentials on %s: %s", service.path.c_str(), strerror(errno));
+    if (getsockopt(conn->fd.get(), SOL_SOCKET, SO_PEERCRED, &cred, &credLength) != 0) {
+        OLOGW("%s no peer credentials on %s: %s", path.c_str(), strerror(errno));
         return;  // conn closes the socket
     }
     conn->uid = cred.uid;
     conn->pid = cred.pid;
 
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     if (connections_.size() >= options_.maxConnections && !EvictIdlestConnection()) {
-        OLOGW("%s refuse pid %d uid %d: %zu connections busy", conn->pid, conn->uid, connections_.size());
+        refusedConnections_.fetch_add(1, std::memory_order_relaxed);
+        OLOGW_LIMITED("%s refuse pid %d uid %d: %zu connections busy", conn->pid, conn->uid, connections_.size());
         return;
     }
     uint64_t id = nextId_++;
     struct epoll_event ev = {};
     ev.events = EPOLLIN | EPOLLRDHUP | EPOLLONESHOT;
     ev.data.u64 = id;
-    if (epoll_ctl(epollFd_, EPOLL_CTL_ADD, fd, &ev) != 0) {
+    if (epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, conn->fd.get(), &ev) != 0) {
         OLOGW("%s epoll_ctl failed: %s", strerror(errno));
         return;
     }
@@ -260,7 +305,7 @@ void HostBinderServer::Accept(size_t serviceIndex) {
 void HostBinderServer::HandleConnection(uint64_t id) {
     std::shared_ptr<Connection> conn;
     {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         auto it = connections_.find(id);
         if (it == connections_.end()) {
             return;  // closed meanwhile
@@ -269,7 +314,7 @@ void HostBinderServer::HandleConnection(uint64_t id) {
         conn->busy = true;
     }
     bool keep = ReadAndServe(*conn);
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     conn->busy = false;
     conn->lastActive = Clock::now();
     if (!keep) {
@@ -279,46 +324,35 @@ void HostBinderServer::HandleConnection(uint64_t id) {
     struct epoll_event ev = {};
     ev.events = EPOLLIN | EPOLLRDHUP | EPOLLONESHOT;
     ev.data.u64 = id;
-    epoll_ctl(epollFd_, EPOLL_CTL_MOD, conn->fd, &ev);
+    epoll_ctl(epollFd_.get(), EPOLL_CTL_MOD, conn->fd.get(), &ev);
 }
 
 bool HostBinderServer::ReadAndServe(Connection& conn) {
     uint8_t chunk[16 * 1024];
-    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * HostBinderFrame::kMaxDescriptors)];
-    struct iovec iov = {chunk, sizeof(chunk)};
-    struct msghdr msg = {};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    msg.msg_control = control;
-    msg.msg_controllen = sizeof(control);
-    ssize_t n;
-    do {
-        n = recvmsg(conn.fd, &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-    } while (n < 0 && errno == EINTR);
+    std::vector<unique_fd> received;
+    ssize_t n = ReceiveFileDescriptorVector(conn.fd, chunk, sizeof(chunk), HostBinderFrame::kMaxDescriptors, &received);
+    if (n < 0 && errno == EMSGSIZE) {
+        badFrames_.fetch_add(1, std::memory_order_relaxed);
+        OLOGW_LIMITED("%s pid %d: more than %zu descriptors, closing", conn.pid, HostBinderFrame::kMaxDescriptors);
+        return false;
+    }
     if (n < 0) {
         if (errno == EAGAIN || errno == EWOULDBLOCK) {
             return true;
         }
-        OLOGW("%s pid %d: read failed: %s", conn.pid, strerror(errno));
+        OLOGW_LIMITED("%s pid %d: read failed: %s", conn.pid, strerror(errno));
         return false;
     }
-    for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c != nullptr; c = CMSG_NXTHDR(&msg, c)) {
-        if (c->cmsg_level == SOL_SOCKET && c->cmsg_type == SCM_RIGHTS) {
-            size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-            for (size_t i = 0; i < count; ++i) {
-                int fd;
-                memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof(int));
-                conn.fds.push_back(fd);
-            }
-        }
-    }
-    if ((msg.msg_flags & MSG_CTRUNC) || conn.fds.size() > HostBinderFrame::kMaxDescriptors) {
-        OLOGW("%s pid %d: more than %zu descriptors, closing", conn.pid, HostBinderFrame::kMaxDescriptors);
+    std::move(received.begin(), received.end(), std::back_inserter(conn.fds));
+    if (conn.fds.size() > HostBinderFrame::kMaxDescriptors) {
+        badFrames_.fetch_add(1, std::memory_order_relaxed);
+        OLOGW_LIMITED("%s pid %d: more than %zu descriptors, closing", conn.pid, HostBinderFrame::kMaxDescriptors);
         return false;
     }
     if (n == 0) {
         if (!conn.buffer.empty()) {
-            OLOGW("%s pid %d: connection ended inside a frame (%zu bytes)", conn.pid, conn.buffer.size());
+            badFrames_.fetch_add(1, std::memory_order_relaxed);
+            OLOGW_LIMITED("%s pid %d: connection ended inside a frame (%zu bytes)", conn.pid, conn.buffer.size());
         }
         return false;
     }
@@ -330,8 +364,10 @@ bool HostBinderServer::ReadAndServe(Connection& conn) {
         if (result == DecodeResult::kIncomplete) {
             return true;
         }
-        if (result == DecodeResult::kMalformed) {
-            OLOGW("%s pid %d: malformed frame, code %u, %u bytes, closing", conn.pid, header.code, header.size);
+        if (result != DecodeResult::kComplete) {
+            (result == DecodeResult::kOversized ? oversizedRequests_ : badFrames_)
+                    .fetch_add(1, std::memory_order_relaxed);
+            OLOGW_LIMITED("%s pid %d: malformed frame, code %u, %u bytes, closing", conn.pid, header.code, header.size);
             return false;
         }
         if (!Serve(conn, header, conn.buffer.data() + HostBinderFrame::kRequestHeaderSize)) {
@@ -361,8 +397,9 @@ bool HostBinderServer::Serve(Connection& conn, const HostBinderFrame::RequestHea
     if (size > 0) {
         memcpy(&frame[HostBinderFrame::kReplyHeaderSize], reply.data(), size);
     }
-    if (!WriteAll(conn.fd, frame.data(), frame.size(), options_.idleTimeoutMs)) {
-        OLOGW("%s pid %d: reply to code %u not taken, closing", conn.pid, header.code);
+    if (!WriteAll(conn.fd.get(), frame.data(), frame.size(), options_.idleTimeoutMs)) {
+        repliesNotTaken_.fetch_add(1, std::memory_order_relaxed);
+        OLOGW_LIMITED("%s pid %d: reply to code %u not taken, closing", conn.pid, header.code);
         return false;
     }
     return true;
@@ -371,20 +408,21 @@ bool HostBinderServer::Serve(Connection& conn, const HostBinderFrame::RequestHea
 void HostBinderServer::CloseIdleConnections() {
     const auto now = Clock::now();
     const auto bound = std::chrono::milliseconds(options_.idleTimeoutMs);
-    std::lock_guard<std::mutex> lock(mutex_);
+    Mutex::Autolock lock(mutex_);
     for (auto it = connections_.begin(); it != connections_.end();) {
         Connection& conn = *it->second;
         auto next = std::next(it);
         if (!conn.busy && now - conn.lastActive > bound) {
-            OLOGW("%s pid %d sent nothing for %d ms, closing", conn.pid, options_.idleTimeoutMs);
+            idleTimeouts_.fetch_add(1, std::memory_order_relaxed);
+            OLOGW_LIMITED("%s pid %d sent nothing for %d ms, closing", conn.pid, options_.idleTimeoutMs);
             CloseConnection(it->first);
         }
         it = next;
     }
 }
 
-// Called with mutex_ held. A flood of connections then only pushes out the idlest ones, so
-// a new client always gets in while a connection is not in a transaction.
+// A flood of connections only pushes out the idlest ones, so a new client always gets in while
+// a connection is not in a transaction.
 bool HostBinderServer::EvictIdlestConnection() {
     auto idlest = connections_.end();
     for (auto it = connections_.begin(); it != connections_.end(); ++it) {
@@ -396,25 +434,19 @@ bool HostBinderServer::EvictIdlestConnection() {
     if (idlest == connections_.end()) {
         return false;
     }
-    OLOGW("%s %zu connections open, closing the idlest, of pid %d", connections_.size(), idlest->second->pid);
+    pushedOut_.fetch_add(1, std::memory_order_relaxed);
+    OLOGW_LIMITED("%s %zu connections open, closing the idlest, of pid %d", connections_.size(), idlest->second->pid);
     CloseConnection(idlest->first);
     return true;
 }
 
-// Called with mutex_ held.
 void HostBinderServer::CloseConnection(uint64_t id) {
     auto it = connections_.find(id);
     if (it == connections_.end()) {
         return;
     }
-    epoll_ctl(epollFd_, EPOLL_CTL_DEL, it->second->fd, nullptr);
+    epoll_ctl(epollFd_.get(), EPOLL_CTL_DEL, it->second->fd.get(), nullptr);
     connections_.erase(it);
-}
-
-HostBinderClient::~HostBinderClient() {
-    if (fd_ >= 0) {
-        close(fd_);
-    }
 }
 
 bool HostBinderClient::Connect(const std::string& socketPath) {
@@ -425,17 +457,13 @@ bool HostBinderClient::Connect(const std::string& socketPath) {
         return false;
     }
     memcpy(addr.sun_path, socketPath.c_str(), socketPath.size());
-    if (fd_ >= 0) {
-        close(fd_);
-    }
-    fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd_ < 0) {
+    fd_.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    if (!fd_.ok()) {
         return false;
     }
-    if (connect(fd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
+    if (connect(fd_.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
         int err = errno;
-        close(fd_);
-        fd_ = -1;
+        fd_.reset();
         errno = err;
         return false;
     }
@@ -443,31 +471,14 @@ bool HostBinderClient::Connect(const std::string& socketPath) {
 }
 
 status_t HostBinderClient::Transact(uint32_t code, const Parcel& data, Parcel* reply, uint32_t flags) {
-    if (fd_ < 0 || data.fileDescriptors().size() > HostBinderFrame::kMaxDescriptors) {
+    if (!fd_.ok() || data.fileDescriptors().size() > HostBinderFrame::kMaxDescriptors) {
         return DEAD_OBJECT;
     }
-    uint32_t header[3] = {code, flags, static_cast<uint32_t>(data.dataSize())};
     // The descriptors ride on the header; the rest of the bytes follow as plain writes.
-    struct iovec iov = {header, sizeof(header)};
-    struct msghdr msg = {};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * HostBinderFrame::kMaxDescriptors)] = {};
-    const std::vector<int>& fds = data.fileDescriptors();
-    if (!fds.empty()) {
-        msg.msg_control = control;
-        msg.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
-        struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
-        c->cmsg_level = SOL_SOCKET;
-        c->cmsg_type = SCM_RIGHTS;
-        c->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
-        memcpy(CMSG_DATA(c), fds.data(), sizeof(int) * fds.size());
-    }
-    ssize_t sent;
-    do {
-        sent = sendmsg(fd_, &msg, MSG_NOSIGNAL);
-    } while (sent < 0 && errno == EINTR);
-    if (sent != static_cast<ssize_t>(sizeof(header)) || !WriteAll(fd_, data.data(), data.dataSize(), -1)) {
+    uint32_t header[3] = {code, flags, static_cast<uint32_t>(data.dataSize())};
+    if (SendFileDescriptorVector(fd_, header, sizeof(header), data.fileDescriptors()) !=
+                static_cast<ssize_t>(sizeof(header)) ||
+        !WriteAll(fd_.get(), data.data(), data.dataSize(), -1)) {
         return DEAD_OBJECT;
     }
     if (flags & IBinder::FLAG_ONEWAY) {
@@ -476,7 +487,7 @@ status_t HostBinderClient::Transact(uint32_t code, const Parcel& data, Parcel* r
     auto readAll = [this](void* out, size_t length) {
         auto* bytes = static_cast<uint8_t*>(out);
         while (length > 0) {
-            ssize_t n = read(fd_, bytes, length);
+            ssize_t n = read(fd_.get(), bytes, length);
             if (n < 0 && errno == EINTR) {
                 continue;
             }

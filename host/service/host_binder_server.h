@@ -13,18 +13,20 @@
 #include <sys/types.h>
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include <android-base/unique_fd.h>
+#include <utils/Condition.h>
+#include <utils/Mutex.h>
 #include <utils/RefBase.h>
 
 #include "host/service/host_binder.h"
+#include "utils/daemon_stats.h"
 
 namespace android {
 namespace Orvane {
@@ -42,11 +44,11 @@ struct RequestHeader {
     uint32_t size;
 };
 
-enum class DecodeResult { kIncomplete, kComplete, kMalformed };
+enum class DecodeResult { kIncomplete, kComplete, kOversized, kMalformed };
 
 // Looks at the bytes received so far on a connection: kComplete when a whole request is
-// there (its bytes follow the header), kMalformed for a byte count over kMaxDataSize or not a
-// multiple of 4 (parcels are made of 32-bit words).
+// there (its bytes follow the header), kOversized for a byte count over kMaxDataSize,
+// kMalformed for one that is not a multiple of 4 (parcels are made of 32-bit words).
 DecodeResult DecodeRequest(const uint8_t* bytes, size_t length, RequestHeader* header);
 
 }  // namespace HostBinderFrame
@@ -54,8 +56,10 @@ DecodeResult DecodeRequest(const uint8_t* bytes, size_t length, RequestHeader* h
 // Serves binder objects, one listening socket each.
 // Threads: the pool threads and every thread inside JoinThreadPool take turns waiting on one
 // epoll set. A connection is armed one-shot, so one thread at a time reads it, runs its
-// transaction and writes the reply; a slow transaction holds only its own thread. The
-// connection table is guarded by mutex_; everything else is set up before the pool starts.
+// transaction and writes the reply; a slow transaction holds only its own thread. The services,
+// the connection table and each connection's busy mark and activity time are guarded by mutex_;
+// a connection's bytes and descriptors belong to the thread serving it.
+// Every rejection is counted in the statistics given at construction, under "service.host.".
 class HostBinderServer : public RefBase {
 public:
     struct Options {
@@ -66,11 +70,13 @@ public:
         int idleTimeoutMs = 5000;
     };
 
-    HostBinderServer();
-    explicit HostBinderServer(const Options& options);
+    explicit HostBinderServer(DaemonStats& stats);
+    HostBinderServer(DaemonStats& stats, const Options& options);
     ~HostBinderServer() override;
 
-    // Listens on socketPath (mode 0660, a stale socket replaced). False with an error line.
+    // Listens on socketPath with mode 0660. A socket left there by an earlier run is replaced;
+    // anything else there (a symbolic link, a file, a folder) is left alone and refused. False
+    // with an error line that says why.
     bool AddService(const std::string& socketPath, const sp<BBinder>& service);
     // Adds threads to the pool; may be called before or after AddService.
     void StartThreadPool(size_t threads);
@@ -81,6 +87,11 @@ public:
 
 private:
     struct Connection;
+    struct Service {
+        std::string path;
+        sp<BBinder> binder;
+        android::base::unique_fd fd;
+    };
 
     void ServeLoop();
     void Accept(size_t serviceIndex);
@@ -89,44 +100,39 @@ private:
     bool ReadAndServe(Connection& conn);
     bool Serve(Connection& conn, const HostBinderFrame::RequestHeader& header, const uint8_t* bytes);
     void CloseIdleConnections();
-    bool EvictIdlestConnection();
-    void CloseConnection(uint64_t id);
-
-    struct Service {
-        int fd;
-        std::string path;
-        sp<BBinder> binder;
-    };
+    bool EvictIdlestConnection() REQUIRES(mutex_);
+    void CloseConnection(uint64_t id) REQUIRES(mutex_);
 
     const Options options_;
-    int epollFd_;
-    int wakeFd_;
-    std::vector<Service> services_;
-    std::vector<std::thread> pool_;
+    const android::base::unique_fd epollFd_;
+    const android::base::unique_fd wakeFd_;
     std::atomic<bool> stopping_{false};
+    DaemonStats::Counter& badFrames_;
+    DaemonStats::Counter& oversizedRequests_;
+    DaemonStats::Counter& idleTimeouts_;
+    DaemonStats::Counter& pushedOut_;
+    DaemonStats::Counter& refusedConnections_;
+    DaemonStats::Counter& repliesNotTaken_;
 
-    std::mutex mutex_;
-    std::condition_variable loopsEnded_;
-    int runningLoops_ = 0;
-    uint64_t nextId_ = 1;
-    std::map<uint64_t, std::shared_ptr<Connection>> connections_;
+    Mutex mutex_;
+    Condition loopsEnded_;
+    std::vector<Service> services_ GUARDED_BY(mutex_);
+    std::vector<std::thread> pool_ GUARDED_BY(mutex_);
+    int runningLoops_ GUARDED_BY(mutex_) = 0;
+    uint64_t nextId_ GUARDED_BY(mutex_) = 1;
+    std::map<uint64_t, std::shared_ptr<Connection>> connections_ GUARDED_BY(mutex_);
 };
 
 // One client connection (orvanectl, tests). Not thread safe.
 class HostBinderClient {
 public:
-    HostBinderClient() = default;
-    ~HostBinderClient();
-    HostBinderClient(const HostBinderClient&) = delete;
-    HostBinderClient& operator=(const HostBinderClient&) = delete;
-
     // False with errno set when nothing listens there.
     bool Connect(const std::string& socketPath);
     // The transport status of the reply, or DEAD_OBJECT when the connection failed.
     status_t Transact(uint32_t code, const Parcel& data, Parcel* reply, uint32_t flags = 0);
 
 private:
-    int fd_ = -1;
+    android::base::unique_fd fd_;
 };
 
 }  // namespace Orvane

@@ -12,7 +12,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <map>
-#include <mutex>
+
+#include <android-base/unique_fd.h>
+#include <utils/Mutex.h>
 
 #include "utils/file_util.h"
 #include "utils/orvane_log.h"
@@ -22,6 +24,8 @@ namespace android {
 namespace Orvane {
 
 namespace {
+
+using android::base::unique_fd;
 
 // One line of a property file: a key=value entry, a blank or comment line, or neither.
 enum class LineKind { kEntry, kBlank, kMalformed };
@@ -78,7 +82,7 @@ bool WriteAll(int fd, const std::string& text) {
 // and foreign lines, through a temporary file renamed over it while holding an flock on a
 // side lock file, so concurrent writers never lose each other's keys. Without the variable the
 // properties live in this process only.
-// Threads: any thread may call; `mutex_` guards every member.
+// Threads: any thread may call; `mutex_` guards every member but the path, fixed at creation.
 class HostPropertyStore {
 public:
     static HostPropertyStore& Get() {
@@ -87,7 +91,7 @@ public:
     }
 
     std::string Read(const std::string& key, const std::string& defaultValue) {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         if (!path_.empty()) {
             RefreshLocked();
         }
@@ -97,37 +101,30 @@ public:
     }
 
     bool Write(const std::string& key, const std::string& value) {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         if (path_.empty()) {
             values_[key] = value;
             return true;
         }
         // The lock file is never replaced, unlike the property file, so all writers lock one inode.
         const std::string lockPath = path_ + ".lock";
-        int lockFd = open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0660);
-        if (lockFd < 0) {
+        unique_fd lockFd(open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0660));
+        if (!lockFd.ok()) {
             OLOG_AS(ANDROID_LOG_ERROR, "SetSysProperity", "%s open %s failed, err:%s", lockPath.c_str(),
                     strerror(errno));
             return false;
         }
-        while (flock(lockFd, LOCK_EX) != 0 && errno == EINTR) {
+        while (flock(lockFd.get(), LOCK_EX) != 0 && errno == EINTR) {
         }
-        bool ok = WriteLocked(key, value);
-        close(lockFd);  // releases the lock
-        return ok;
+        return WriteLocked(key, value);  // closing lockFd then releases the file lock
     }
 
 private:
-    HostPropertyStore() {
-        const char* path = getenv("ORVANE_PROPERTY_FILE");
-        if (path != nullptr) {
-            path_ = path;
-        }
-    }
+    HostPropertyStore() : path_(getenv("ORVANE_PROPERTY_FILE") != nullptr ? getenv("ORVANE_PROPERTY_FILE") : "") {}
 
     // Reads the file when it changed since the last parse. A missing file holds no properties;
     // an unreadable one is reported once and read as empty; neither stops the caller.
-    void RefreshLocked() {
+    void RefreshLocked() REQUIRES(mutex_) {
         struct stat st;
         if (stat(path_.c_str(), &st) == 0 && FileUtil::StampOf(st) == stamp_) {
             return;
@@ -154,28 +151,25 @@ private:
     // Opens and reads the property file; 0 or the error number. `stamp` (and `mode` when
     // asked) describe the version read; a missing file gives an empty text.
     int ReadFile(std::string& text, FileStamp& stamp, mode_t* mode) {
-        int fd = open(path_.c_str(), O_RDONLY | O_CLOEXEC);
-        if (fd < 0) {
+        unique_fd fd(open(path_.c_str(), O_RDONLY | O_CLOEXEC));
+        if (!fd.ok()) {
             return errno;
         }
         struct stat st;
-        int err = 0;
-        if (fstat(fd, &st) != 0 || !ReadAll(fd, text)) {
-            err = errno;
-        } else {
-            stamp = FileUtil::StampOf(st);
-            if (mode != nullptr) {
-                *mode = st.st_mode & 07777;
-            }
+        if (fstat(fd.get(), &st) != 0 || !ReadAll(fd.get(), text)) {
+            return errno;
         }
-        close(fd);
-        return err;
+        stamp = FileUtil::StampOf(st);
+        if (mode != nullptr) {
+            *mode = st.st_mode & 07777;
+        }
+        return 0;
     }
 
     // Replaces `values_` with the entries of `text`; a later line for a key wins. Malformed
     // lines are skipped with one warning for the lot, and only when they differ from the lines
     // already warned about, so a bad line does not warn again at every reload.
-    void Parse(const std::string& text) {
+    void Parse(const std::string& text) REQUIRES(mutex_) {
         values_.clear();
         std::string malformed;
         size_t count = 0;
@@ -202,7 +196,7 @@ private:
 
     // Called with the file lock held: rereads the file so that no other writer's change is lost,
     // sets the key on its own line (in place, or appended), and renames the new text over it.
-    bool WriteLocked(const std::string& key, const std::string& value) {
+    bool WriteLocked(const std::string& key, const std::string& value) REQUIRES(mutex_) {
         std::string text;
         FileStamp stamp;
         mode_t mode = 0644;
@@ -231,13 +225,12 @@ private:
         }
 
         const std::string tmp = path_ + ".tmp." + std::to_string(getpid());
-        int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+        unique_fd fd(open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode));
         struct stat st;
-        bool ok = fd >= 0 && fchmod(fd, mode) == 0 && WriteAll(fd, updated) && fsync(fd) == 0 && fstat(fd, &st) == 0;
+        bool ok = fd.ok() && fchmod(fd.get(), mode) == 0 && WriteAll(fd.get(), updated) && fsync(fd.get()) == 0 &&
+                  fstat(fd.get(), &st) == 0;
         err = errno;
-        if (fd >= 0) {
-            close(fd);
-        }
+        fd.reset();
         if (!ok || rename(tmp.c_str(), path_.c_str()) != 0) {
             err = ok ? errno : err;
             OLOG_AS(ANDROID_LOG_ERROR, "SetSysProperity", "%s write %s failed, err:%s", path_.c_str(), strerror(err));
@@ -249,12 +242,12 @@ private:
         return true;
     }
 
-    std::mutex mutex_;
-    std::string path_;
-    FileStamp stamp_;
-    int lastReadErrno_ = 0;
-    std::string warnedMalformed_;
-    std::map<std::string, std::string> values_;
+    Mutex mutex_;
+    const std::string path_;
+    FileStamp stamp_ GUARDED_BY(mutex_);
+    int lastReadErrno_ GUARDED_BY(mutex_) = 0;
+    std::string warnedMalformed_ GUARDED_BY(mutex_);
+    std::map<std::string, std::string> values_ GUARDED_BY(mutex_);
 };
 
 }  // namespace

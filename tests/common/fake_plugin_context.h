@@ -2,7 +2,8 @@
 #define ORVANE_TESTS_COMMON_FAKE_PLUGIN_CONTEXT_H
 
 #include <map>
-#include <mutex>
+
+#include <utils/Mutex.h>
 
 #include "platform/event_loop.h"
 #include "platform/plugin_context.h"
@@ -23,7 +24,7 @@ public:
     }
     ~FakePluginContext() override { sharedLoop_->StopLoop(); }
     std::vector<std::pair<std::string, sp<Event>>> Inserted() {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         return inserted_;
     }
 
@@ -34,11 +35,11 @@ public:
     sp<EventLoop> GetSharedWorkLoop() override { return sharedLoop_; }
     sp<EventLoop> GetLooperByName(const std::string&) override { return sharedLoop_; }
     std::string GetSysProperity(const std::string& key, const std::string& defaultValue) override {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         return properties_.count(key) != 0 ? properties_[key] : defaultValue;
     }
     bool SetSysProperity(const std::string& key, const std::string& value) override {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         properties_[key] = value;
         return true;
     }
@@ -51,7 +52,7 @@ public:
     bool PostSyncEventToTarget(const std::string&, sp<Event>) override { return false; }
     bool PostAsyncEventToTarget(const std::string&, sp<Event>) override { return false; }
     bool InsertEventToPipeline(const std::string& pipelineName, sp<Event> event) override {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         inserted_.emplace_back(pipelineName, event);
         return true;
     }
@@ -62,9 +63,9 @@ public:
     const std::string workDir_, configDir_;
     const std::map<std::string, std::string> devices_;
     sp<EventLoop> sharedLoop_;
-    std::mutex mutex_;
-    std::map<std::string, std::string> properties_;
-    std::vector<std::pair<std::string, sp<Event>>> inserted_;
+    Mutex mutex_;
+    std::map<std::string, std::string> properties_ GUARDED_BY(mutex_);
+    std::vector<std::pair<std::string, sp<Event>>> inserted_ GUARDED_BY(mutex_);
     DaemonStats stats_;
 };
 

@@ -1,16 +1,16 @@
 #include "tests/common/log_capture.h"
 
-#include <mutex>
+#include <utils/Mutex.h>
 
 namespace android::Orvane {
 namespace {
 
-std::mutex gMutex;
-std::vector<LogLine> gLines;
-bool gActive = false;
+Mutex gMutex;
+std::vector<LogLine> gLines GUARDED_BY(gMutex);
+bool gActive GUARDED_BY(gMutex) = false;
 
 void Record(int priority, const char* tag, const char* message) {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     if (gActive) {
         gLines.push_back({priority, tag ? tag : "", message ? message : ""});
     }
@@ -34,7 +34,7 @@ void CaptureLogger(const struct __android_logger_data* data, const char* message
 
 LogCapture::LogCapture() {
     {
-        std::lock_guard<std::mutex> lock(gMutex);
+        Mutex::Autolock lock(gMutex);
         gLines.clear();
         gActive = true;
     }
@@ -44,18 +44,18 @@ LogCapture::LogCapture() {
 
 LogCapture::~LogCapture() {
     __android_log_set_logger(DEFAULT_LOGGER);
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     gActive = false;
     gLines.clear();
 }
 
 std::vector<LogLine> LogCapture::Lines() const {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     return gLines;
 }
 
 size_t LogCapture::Count(int priority, const std::string& text) const {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     size_t count = 0;
     for (const auto& line : gLines) {
         if (line.priority == priority && line.tag == "orvane" && line.message.find(text) != std::string::npos) {
@@ -70,12 +70,12 @@ bool LogCapture::WaitFor(int priority, const std::string& text, std::chrono::mil
 }
 
 void LogCapture::Clear() {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     gLines.clear();
 }
 
 std::string LogCapture::Dump() const {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     std::string out;
     for (const auto& line : gLines) {
         out += std::to_string(line.priority) + " " + line.tag + ": " + line.message + "\n";

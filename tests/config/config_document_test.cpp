@@ -1,6 +1,9 @@
 #include "config/config_document.h"
 
+#include <zip.h>
+
 #include <fstream>
+#include <tuple>
 
 #include <android-base/file.h>
 #include <gtest/gtest.h>
@@ -22,14 +25,14 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
     DaemonStats stats;
     LogCapture capture;
 
-    DocumentChoice none = ConfigDocument::Choose(cld, sys, "a.xml", &stats);
+    DocumentChoice none = ConfigDocument::Choose({cld, sys, &stats}, "a.xml");
     EXPECT_EQ(none.directory, sys);
     EXPECT_EQ(none.stamp.size, -1);
 
     Write(sys + "a.xml", "<a/>");
     Write(cld + "a.xml", "<a><b></a>");  // not well-formed
     for (int i = 0; i < 3; ++i) {
-        DocumentChoice choice = ConfigDocument::Choose(cld, sys, "a.xml", &stats);
+        DocumentChoice choice = ConfigDocument::Choose({cld, sys, &stats}, "a.xml");
         EXPECT_EQ(choice.path, sys + "a.xml");
         EXPECT_FALSE(choice.fromCloud);
     }
@@ -37,18 +40,42 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 1u);
 
     Write(cld + "a.xml", "<a><b/></a>\n");  // the update: a new version that parses
-    DocumentChoice pushed = ConfigDocument::Choose(cld, sys, "a.xml", &stats);
+    DocumentChoice pushed = ConfigDocument::Choose({cld, sys, &stats}, "a.xml");
     EXPECT_TRUE(pushed.fromCloud);
     EXPECT_EQ(pushed.path, cld + "a.xml");
     EXPECT_EQ(pushed.stamp, FileUtil::GetFileStamp(cld + "a.xml"));
 
     Write(cld + "a.xml", "");  // an empty copy is not a document
-    EXPECT_FALSE(ConfigDocument::Choose(cld, sys, "a.xml", &stats).fromCloud);
+    EXPECT_FALSE(ConfigDocument::Choose({cld, sys, &stats}, "a.xml").fromCloud);
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 2u);
     // Entities are never loaded: a copy that needs one to parse is passed over.
     Write(cld + "a.xml", "<!DOCTYPE a [<!ENTITY x SYSTEM \"file:///etc/passwd\">]><a>&x;</a>");
-    EXPECT_FALSE(ConfigDocument::Choose(cld, sys, "a.xml", &stats).fromCloud);
+    EXPECT_FALSE(ConfigDocument::Choose({cld, sys, &stats}, "a.xml").fromCloud);
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 3u);
+}
+
+// An archive copy is judged by its document entry ("x.zip" holds "x.xml"), not as XML itself.
+TEST(ConfigDocumentTest, ArchiveCopyIsJudgedByItsEntry) {
+    TemporaryDir system, cloud;
+    std::string sys = std::string(system.path) + "/", cld = std::string(cloud.path) + "/";
+    auto zip = [&](const std::string& entry, const std::string& content) {
+        zipFile archive = zipOpen((cld + "x.zip").c_str(), APPEND_STATUS_CREATE);
+        ASSERT_NE(archive, nullptr);
+        EXPECT_EQ(zipOpenNewFileInZip(archive, entry.c_str(), nullptr, nullptr, 0, nullptr, 0, nullptr, Z_DEFLATED,
+                                      Z_DEFAULT_COMPRESSION),
+                  ZIP_OK);
+        EXPECT_EQ(zipWriteInFileInZip(archive, content.data(), content.size()), ZIP_OK);
+        EXPECT_EQ(zipCloseFileInZip(archive), ZIP_OK);
+        EXPECT_EQ(zipClose(archive, nullptr), ZIP_OK);
+    };
+    DaemonStats stats;
+    const std::tuple<std::string, std::string, bool> cases[] = {
+            {"x.xml", "<x><y/></x>", true}, {"x.xml", "<x><y></x>", false}, {"other.xml", "<x/>", false}};
+    for (const auto& [entry, content, chosen] : cases) {
+        zip(entry, content);
+        EXPECT_EQ(ConfigDocument::Choose({cld, sys, &stats}, "x.zip").fromCloud, chosen) << entry << " " << content;
+    }
+    EXPECT_EQ(stats.Value("config.cloud_rejected.x.zip"), 2u);
 }
 
 }  // namespace

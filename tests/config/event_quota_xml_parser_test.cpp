@@ -1,9 +1,9 @@
 #include "config/event_quota_xml_parser.h"
 
-#include <filesystem>
-#include <fstream>
+#include <atomic>
 #include <thread>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -18,19 +18,22 @@ const char kSection[] = "unknown";
 // outlive a reload, use range keys of their own in each test.
 class EventQuotaXmlParserTest : public ::testing::Test {
 protected:
-    void TearDown() override { std::filesystem::remove_all(dir_); }
+    // Replaces the document at once, as a push does, so a concurrent reader sees the old or the new one.
     void Write(const std::string& content) {
-        std::ofstream(dir_ + "event_quota.xml", std::ios::binary | std::ios::trunc) << content;
+        ASSERT_TRUE(android::base::WriteStringToFile(content, dir_ + "next.xml"));
+        ASSERT_EQ(rename((dir_ + "next.xml").c_str(), (dir_ + "event_quota.xml").c_str()), 0);
     }
     // dailyCnt maxLogCnt logSpace same logCnt of the quota for id.
-    std::vector<int64_t> Quota(uint32_t id, const std::string& dir = "") {
-        DomainQuota q = parser_->GetEventQuota(dir_ + dir, kSection, id);
+    std::vector<int64_t> Quota(uint32_t id, const DocumentFolders& folders) {
+        DomainQuota q = parser_->GetEventQuota(folders, kSection, id);
         return {q.dailyCnt, q.maxLogCnt, q.logSpace, q.same, q.logCnt};
     }
+    std::vector<int64_t> Quota(uint32_t id) { return Quota(id, dir_); }
     bool Incr(uint32_t id, int32_t incr, DomainQuota* record = nullptr) {
         return parser_->CheckLogCntLimitAfterIncr(dir_, kSection, id, incr, record);
     }
-    std::string dir_ = mkdtemp(std::string("/tmp/event_quota_xml_parser_test.XXXXXX").data()) + std::string("/");
+    TemporaryDir temp_;
+    std::string dir_ = std::string(temp_.path) + "/";
     sp<EventQuotaXmlParser> parser_ = EventQuotaXmlParser::getInstance();
 };
 
@@ -79,22 +82,81 @@ TEST_F(EventQuotaXmlParserTest, PrecedenceInOrderAndLogCountsAfterTheIncrement) 
               (std::vector<int64_t>{802, 805, 800}));
 }
 
-TEST_F(EventQuotaXmlParserTest, LoadsOncePerFolderAndSection) {
+// The document is read again exactly when the copy in force, its version or the section changed.
+TEST_F(EventQuotaXmlParserTest, ReadsAgainOnlyWhenTheChosenCopyOrTheSectionChanges) {
+    LogCapture logs;
     // Everything after the wanted section lies in a later block and is broken; it is never read.
-    Write(R"(<Quota><unknown><Summary defDailyCnt="11"/></unknown>
+    Write(R"(<Quota><unknown><Summary defDailyCnt="11"/><Domain name="once" eventMin="1" eventMax="2"/></unknown>
 <beta><Summary defDailyCnt="22" defLogCnt="3"/><Domain name="d" eventMin="950000000" eventMax="950999999"/></beta>
 <!-- )" + std::string(9000, 'x') +
           " -->\n<broken attr=no quotes></Quota>");
-    EXPECT_EQ(parser_->StartParserXml(dir_, kSection), 0);
-    EXPECT_EQ(parser_->GetSummaryQuota(dir_, kSection).defDailyCnt, 11u);
+    for (int i = 0; i < 3; ++i)
+        EXPECT_EQ(parser_->GetSummaryQuota(dir_, kSection).defDailyCnt, 11u);
+    EXPECT_EQ(logs.Count(ANDROID_LOG_DEBUG, "SaveDomainQuota domain once:"), 1u);
     EXPECT_EQ(parser_->StartParserXml(dir_, "beta"), 0);
     EXPECT_EQ(parser_->GetEventQuota(dir_, "beta", 950000001).maxLogCnt, 3u);
-    Write("<beta><Summary defDailyCnt=\"33\"/></beta>");
-    EXPECT_EQ(parser_->GetSummaryQuota(dir_, "beta").defDailyCnt, 22u);  // not read again
-    LogCapture logs;  // an unreadable document: the defaults, and one failed try
-    EXPECT_EQ(Quota(960000001, "absent/"), (std::vector<int64_t>{200, 10, 300, 0, 0}));
-    EXPECT_EQ(parser_->StartParserXml(dir_ + "absent/", kSection), -1);
-    EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "StartParserXml parse xml file failed " + dir_ + "absent/"), 1u);
+    Write("<beta><Summary defDailyCnt=\"33\"/></beta>");  // a new version, seen by the next query
+    EXPECT_EQ(parser_->GetSummaryQuota(dir_, "beta").defDailyCnt, 33u);
+
+    // An unreadable document: the defaults, one failed try per version, counted; read once it exists.
+    TemporaryDir other;
+    DaemonStats stats;
+    const std::string otherDir = std::string(other.path) + "/";
+    DocumentFolders absent(otherDir, otherDir, &stats);
+    for (int i = 0; i < 3; ++i)
+        EXPECT_EQ(Quota(960000001, absent), (std::vector<int64_t>{200, 10, 300, 0, 0}));
+    EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "StartParserXml parse xml file failed " + absent.configDir), 1u);
+    EXPECT_EQ(stats.Value("config.read_failed.event_quota.xml"), 1u);
+    ASSERT_TRUE(android::base::WriteStringToFile("<Q><unknown><Summary defDailyCnt=\"44\"/></unknown></Q>",
+                                                 absent.configDir + "event_quota.xml"));
+    EXPECT_EQ(Quota(960000001, absent)[0], 44);
+}
+
+// Counters belong to their range: a reload with new limits goes on from the counts, a document
+// that leaves a range out does not lose its count, and counting while documents are pushed loses
+// nothing.
+TEST_F(EventQuotaXmlParserTest, LogCountersOutliveReloadsByRange) {
+    auto doc = [](const std::string& body) { return "<Quota><unknown>" + body + "</unknown></Quota>"; };
+    auto kernel = [](const std::string& name, int domainMax, int subMax) {
+        return "<Domain name=\"" + name + "\" eventMin=\"920000000\" eventMax=\"920999999\" maxLogCnt=\"" +
+               std::to_string(domainMax) + "\"><SubDomain eventMin=\"920001000\" eventMax=\"920001999\" maxLogCnt=\"" +
+               std::to_string(subMax) + "\"/></Domain>";
+    };
+    // Same range, sorts after the others: it is never counted, and its 0 must not win over their count.
+    const std::string twin = R"(<Domain name="zz" eventMin="920000000" eventMax="920999999" maxLogCnt="2"/>)";
+    Write(doc(kernel("k", 5, 4) + twin));
+    EXPECT_FALSE(Incr(920001001, 3));  // sub-domain 3 < 4, domain 3 < 5
+
+    Write(doc(kernel("renamed", 7, 9) + twin));  // new limits, the same ranges
+    DomainQuota record;
+    EXPECT_FALSE(Incr(920001001, 3, &record));  // 6 < 9 and 6 < 7
+    EXPECT_EQ(record.logCnt, 6);
+    EXPECT_TRUE(Incr(920500000, 1));  // the domain alone: 7 >= 7
+
+    Write(doc("<Summary defLogCnt=\"50\" defDailyCnt=\"123\"/>"));  // the ranges are gone
+    EXPECT_EQ(Quota(920001001)[0], 123);
+    EXPECT_FALSE(Incr(920001001, 1));  // the fallback counter of 920 takes it
+    Write(doc(kernel("k", 5, 4) + twin));
+    EXPECT_EQ(Quota(920001001)[4], 6);  // back with the sub-domain's count
+    EXPECT_TRUE(Incr(920500000, 0, &record));
+    EXPECT_EQ(record.logCnt, 7);
+
+    std::atomic<bool> counting{true};
+    std::thread pusher([&] {
+        for (int i = 0; counting; ++i)
+            Write(doc(kernel("k", 100 + i % 2, 200)));
+    });
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t)
+        threads.emplace_back([this] {
+            for (int i = 0; i < 300; ++i)
+                Incr(920700000, 1);
+        });
+    for (std::thread& thread : threads)
+        thread.join();
+    counting = false;
+    pusher.join();
+    EXPECT_EQ(Quota(920700000)[4], 7 + 1200);
 }
 
 }  // namespace

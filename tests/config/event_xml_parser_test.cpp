@@ -1,15 +1,20 @@
 #include "config/event_xml_parser.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+
 #include <atomic>
-#include <filesystem>
-#include <fstream>
 #include <map>
 #include <random>
 #include <regex>
 #include <thread>
 #include <tuple>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
+
+#include "tests/common/log_capture.h"
+#include "utils/string_util.h"
 
 namespace android::Orvane {
 namespace {
@@ -22,32 +27,45 @@ std::string Entry(uint32_t id, const std::string& attrs = "FaultType=\"FAULT\"",
     return text + "  </Event>\n";
 }
 
+std::string Document(const std::string& entries) {
+    return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<Events>\n" + entries + "</Events>\n";
+}
+
 class EventXmlParserTest : public ::testing::Test {
 protected:
-    void TearDown() override { std::filesystem::remove_all(dir_); }
-    void Write(const std::string& entries) {
-        std::ofstream(dir_ + "event.xml", std::ios::trunc)
-                << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<Events>\n" + entries + "</Events>\n";
+    void Write(const std::string& entries, const std::string& dir = "") {
+        ASSERT_TRUE(android::base::WriteStringToFile(Document(entries), (dir.empty() ? dir_ : dir) + "event.xml"));
+    }
+    // Changes the text in place but leaves the file's stamp (size, time) as it was: a change the
+    // cache cannot see, so that what the cache holds shows.
+    void ReplaceUnseen(const std::string& from, const std::string& to) {
+        ASSERT_EQ(from.size(), to.size());
+        std::string path = dir_ + "event.xml", text;
+        struct stat before;
+        ASSERT_TRUE(stat(path.c_str(), &before) == 0 && android::base::ReadFileToString(path, &text));
+        ASSERT_TRUE(android::base::WriteStringToFile(StringUtil::ReplaceStr(text, from, to), path));
+        const struct timespec times[2] = {before.st_atim, before.st_mtim};
+        ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
     }
     sp<EventInfoConfig> Get(uint32_t id) { return parser_->GetEventInfoConfig(dir_, id); }
 
-    std::string dir_ = mkdtemp(std::string("/tmp/event_xml_parser_test.XXXXXX").data()) + std::string("/");
+    TemporaryDir temp_;
+    std::string dir_ = std::string(temp_.path) + "/";
     sp<EventXmlParser> parser_ = EventXmlParser::getInstance();
 };
 
-// First in this file, so that it starts with an empty cache when the whole file runs in one process.
 TEST_F(EventXmlParserTest, CacheHoldsFiftyEntriesAndNeverRemembersMisses) {
-    std::string entries;
+    std::string entries = Entry(913000200);
     for (uint32_t id = 913000000; id < 913000050; ++id)
         entries += Entry(id);
     Write(entries);
     std::map<uint32_t, sp<EventInfoConfig>> cached;
     for (uint32_t id = 913000000; id < 913000050; ++id)
         ASSERT_NE(cached[id] = Get(id), nullptr);
-    Write("");                           // from now on only cached entries are found
-    EXPECT_EQ(Get(913000100), nullptr);  // a miss, not remembered
-    Write(Entry(913000100));             // the 51st evicts exactly one
-    ASSERT_NE(Get(913000100), nullptr);
+    EXPECT_EQ(Get(913000100), nullptr);                           // a miss, not remembered:
+    ReplaceUnseen("\"913000200\"", "\"913000100\"");              // it is found once there
+    ASSERT_NE(Get(913000100), nullptr);                           // and as the 51st it evicts exactly one
+    ReplaceUnseen("<Event id=\"9130000", "<Event id=\"9140000");  // only cached entries are found now
     size_t kept = 0;
     for (const auto& [id, entry] : cached) {
         sp<EventInfoConfig> now = Get(id);
@@ -135,6 +153,38 @@ TEST_F(EventXmlParserTest, AttributeScannerAgreesWithThePattern) {
             pairs[(*it)[1]] = (*it)[2];
         ASSERT_EQ(EventXmlParser::ExtractAttributes(text), pairs) << text;
     }
+}
+
+// Each lookup reads the copy in force, and a change of copy or version drops the cache. A
+// catalogue that cannot be read fails every lookup: one line (collapsed), every failure counted.
+TEST_F(EventXmlParserTest, CopyInForceIsReadAndItsChangeDropsTheCache) {
+    TemporaryDir cloud;
+    const std::string cloudDir = std::string(cloud.path) + "/";
+    DaemonStats stats;
+    DocumentFolders folders(cloudDir, dir_, &stats);
+    auto level = [&](uint32_t id) {
+        sp<EventInfoConfig> e = parser_->GetEventInfoConfig(folders, id);
+        return e == nullptr ? -1 : static_cast<int>(e->faultLevel);
+    };
+    Write(Entry(914000001, "FaultLevel=\"1\""));
+    EXPECT_EQ(level(914000001), 1);
+    Write(Entry(914000001, "FaultLevel=\"3\""), cloudDir);  // pushed
+    EXPECT_EQ(level(914000001), 3);
+    Write(Entry(914000001, "FaultLevel=\"CRITICAL\""), cloudDir);  // pushed again
+    EXPECT_EQ(level(914000001), 4);
+    ASSERT_TRUE(android::base::WriteStringToFile("<Events><Event id=\"914000001\" FaultLevel=\"2\">",
+                                                 cloudDir + "event.xml"));
+    EXPECT_EQ(level(914000001), 1);  // a broken push is passed over
+    EXPECT_EQ(stats.Value("config.cloud_rejected.event.xml"), 1u);
+
+    LogCapture logs;
+    ASSERT_EQ(unlink((dir_ + "event.xml").c_str()), 0);
+    ASSERT_EQ(unlink((cloudDir + "event.xml").c_str()), 0);
+    for (int i = 0; i < 5; ++i)
+        EXPECT_EQ(level(914000001), -1);
+    EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "upload failed"), 1u) << logs.Dump();
+    EXPECT_TRUE(logs.Contains(ANDROID_LOG_WARN, "GetEventInfoConfig upload failed, " + dir_ + ", event.xml"));
+    EXPECT_EQ(stats.Value("config.read_failed.event.xml"), 5u);
 }
 
 }  // namespace

@@ -20,7 +20,7 @@ std::string Policy(const std::string& levels, const std::string& body = "") {
 
 class PrivacyPolicyTest : public ::testing::Test {
 protected:
-    std::shared_ptr<const PrivacyPolicy> Get() { return parser_->GetPolicy(cloud_, config_, &stats_); }
+    std::shared_ptr<const PrivacyPolicy> Get() { return parser_->GetPolicy({cloud_, config_, &stats_}); }
 
     TemporaryDir root_;
     std::string config_ = std::string(root_.path) + "/etc/";

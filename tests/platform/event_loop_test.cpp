@@ -105,6 +105,65 @@ TEST_F(EventLoopTest, WaitResultBlocksUntilRunAndFailsOnlyOnMinusOne) {
     EXPECT_EQ(loop_->AddEvent(handler, nullptr), UINT64_MAX);
 }
 
+// A caller waiting for an entry that only its own thread could run, or that a stopped loop never
+// runs, would wait for good: both are refused at once with one error line.
+TEST_F(EventLoopTest, WaitResultRefusedOnItsOwnLoopAndOnAStoppedLoop) {
+    LogCapture capture;
+    std::atomic<int> runs{0};
+    sp<EventHandler> handler = new CallbackHandler([&runs](sp<Event>&) { return ++runs; });
+    sp<Event> event = new Event("test");
+    // 0 while waiting, then 1 for false and 2 for true. The task holds the loop, so a loop stuck
+    // waiting for itself is left behind instead of hanging the test's teardown.
+    auto result = std::make_shared<std::atomic<int>>(0);
+    loop_->AddTask([loop = loop_, handler, event, result] { *result = loop->AddEventWaitResult(handler, event) + 1; });
+    ASSERT_TRUE(WaitUntil([&] { return *result != 0; })) << "a wait on the loop's own thread hangs";
+    EXPECT_EQ(*result, 1);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "AddEventWaitResult"), 1u) << capture.Dump();
+    // From another thread the same call runs the handler.
+    EXPECT_TRUE(loop_->AddEventWaitResult(handler, event));
+    EXPECT_EQ(runs, 1);
+
+    loop_->StopLoop();
+    capture.Clear();
+    *result = 0;
+    std::thread waiter(
+            [loop = loop_, handler, event, result] { *result = loop->AddEventWaitResult(handler, event) + 1; });
+    bool returned = WaitUntil([&] { return *result != 0; });
+    returned ? waiter.join() : waiter.detach();
+    ASSERT_TRUE(returned) << "a wait on a stopped loop hangs";
+    EXPECT_EQ(*result, 1);
+    EXPECT_EQ(runs, 1);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "AddEventWaitResult"), 1u) << capture.Dump();
+}
+
+TEST_F(EventLoopTest, BacklogAndItsHighWaterMarkAndSlowEntriesAreReported) {
+    LogCapture capture;
+    auto stats = std::make_shared<DaemonStats>();
+    sp<EventLoop> loop = new EventLoop("stats_loop", stats);
+    loop->StartLoop();
+    Gate gate;
+    loop->AddTask([&gate] { gate.Wait(); });
+    ASSERT_TRUE(WaitUntil([&] { return loop->GetBacklog() == 0; }));  // taken: it holds the loop
+    for (int i = 0; i < 5; i++) {
+        loop->AddTask([] {});
+    }
+    loop->AddTask([] {}, 60);
+    EXPECT_EQ(loop->GetBacklog(), 6u);
+    gate.Open();
+    ASSERT_TRUE(WaitUntil([&] { return loop->GetBacklog() == 1; }));  // the one due in a minute
+    EXPECT_EQ(stats->Value("loop.stats_loop.backlog_high"), 6u);
+    // Only what runs 301 ms or more counts as slow, with the loop's line for it.
+    loop->AddTask([] { std::this_thread::sleep_for(milliseconds(320)); });
+    loop->AddTask([] { std::this_thread::sleep_for(milliseconds(5)); });
+    std::atomic<bool> done{false};
+    loop->AddTask([&done] { done = true; });
+    ASSERT_TRUE(WaitUntil([&] { return done.load(); }));
+    EXPECT_EQ(stats->Value("loop.stats_loop.slow"), 1u);
+    EXPECT_EQ(capture.Count(ANDROID_LOG_DEBUG, "ProcessEventLoop onevent name stats_loop  consume time 3"), 1u)
+            << capture.Dump();
+    loop->StopLoop();
+}
+
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
     std::string stat = "/proc/self/task/" + std::to_string(Drain()) + "/stat";
     std::atomic<int> ran{0};

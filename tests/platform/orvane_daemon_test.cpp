@@ -7,6 +7,7 @@
 
 #include <fstream>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -20,9 +21,6 @@ class OrvaneDaemonTest : public testing::Test {
 protected:
     void SetUp() override {
         ASSERT_EQ(access(ORVANE_BINARY_DIR "/orvane", X_OK), 0) << "the daemon is not built";
-        char pattern[] = "/tmp/orvane_daemon_test_XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
         ASSERT_EQ(mkdir((root_ + "/etc").c_str(), 0755), 0);
         std::ofstream(root_ + "/etc/plugin_config") << "plugins:1\nNoSuchPlugin[thread:test_loop]:0 static\n";
     }
@@ -31,7 +29,6 @@ protected:
             if (waitpid(pid, nullptr, WNOHANG) == 0 && kill(pid, SIGKILL) == 0)
                 waitpid(pid, nullptr, 0);  // still ours
         }
-        system(("rm -rf " + root_).c_str());
     }
 
     // Starts the daemon on the test folders, its standard error going to `<name>.log`.
@@ -58,7 +55,8 @@ protected:
         return ended && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     }
 
-    std::string root_;
+    TemporaryDir tmp_;
+    const std::string root_ = tmp_.path;
     std::vector<pid_t> started_;
 };
 

@@ -3,10 +3,10 @@
 
 #include <algorithm>
 #include <future>
-#include <mutex>
 #include <thread>
 
 #include <gtest/gtest.h>
+#include <utils/Mutex.h>
 
 #include "platform/event_loop.h"
 #include "tests/common/log_capture.h"
@@ -22,11 +22,11 @@ public:
         std::chrono::steady_clock::time_point when;
     };
     void Add(const std::string& what) {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         records_.push_back({what, std::this_thread::get_id(), std::chrono::steady_clock::now()});
     }
     std::vector<Record> Records() {
-        std::lock_guard<std::mutex> lock(mutex_);
+        Mutex::Autolock lock(mutex_);
         return records_;
     }
     std::vector<std::string> Entries() {
@@ -49,8 +49,8 @@ public:
     }
 
 private:
-    std::mutex mutex_;
-    std::vector<Record> records_;
+    Mutex mutex_;
+    std::vector<Record> records_ GUARDED_BY(mutex_);
 };
 
 // Holds whoever waits at it until the test opens it.

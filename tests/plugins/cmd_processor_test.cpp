@@ -9,6 +9,7 @@
 #include <atomic>
 #include <thread>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -22,8 +23,6 @@ using std::chrono::seconds;
 
 class CmdProcessorTest : public testing::Test {
 protected:
-    void TearDown() override { unlink(script_.c_str()); }
-
     std::string WriteScript(const std::string& body) {
         EXPECT_TRUE(FileUtil::SaveStringToFile(script_, "#!/bin/sh\n" + body + "\n", true));
         chmod(script_.c_str(), 0755);
@@ -32,15 +31,15 @@ protected:
 
     // Runs the command with its output into a file and returns what it wrote.
     static std::string Run(const std::string& command, int timeoutSeconds) {
-        FILE* out = tmpfile();
-        EXPECT_TRUE(CmdProcessor::WriteCommandResultToFileWithTimeout(fileno(out), command, timeoutSeconds));
+        TemporaryFile out;
+        EXPECT_TRUE(CmdProcessor::WriteCommandResultToFileWithTimeout(out.fd, command, timeoutSeconds));
         std::string content(4096, '\0');
-        content.resize(std::max<ssize_t>(0, pread(fileno(out), &content[0], content.size(), 0)));
-        fclose(out);
+        content.resize(std::max<ssize_t>(0, pread(out.fd, &content[0], content.size(), 0)));
         return content;
     }
 
-    const std::string script_ = "/tmp/cmd_processor_test_" + std::to_string(getpid()) + ".sh";
+    TemporaryDir folder_;
+    const std::string script_ = std::string(folder_.path) + "/command.sh";
 };
 
 TEST_F(CmdProcessorTest, OutputAndExitCodesOfFinishedCommands) {

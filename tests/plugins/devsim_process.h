@@ -10,55 +10,59 @@
 
 #include <string>
 
+#include <android-base/file.h>
+#include <android-base/unique_fd.h>
+
 #include "tests/common/log_capture.h"
 
 namespace android::Orvane {
 
-// orvane-devsim serving a fresh folder, for as long as the object lives.
+// orvane-devsim serving a folder of its own, for as long as the object lives. Stopping and
+// starting it again makes the nodes vanish and come back at the same paths.
 class DevSim {
 public:
-    // False with the emulator's own one-line reason when FUSE cannot be mounted (in a fresh
-    // folder unless one is given).
+    // False with the emulator's own one-line reason when FUSE cannot be mounted (in the object's
+    // folder unless one is given; its node paths are known before it is started).
     bool Start(std::string* failure, const char* mountAt = nullptr) {
-        char folderTemplate[] = "/tmp/orvane-devsim-test-XXXXXX";
+        using android::base::unique_fd;
         int errPipe[2];
-        if ((mountAt == nullptr && mkdtemp(folderTemplate) == nullptr) || pipe2(errPipe, O_CLOEXEC) != 0) {
-            *failure = "cannot create a mount folder or a pipe";
+        if (pipe2(errPipe, O_CLOEXEC) != 0) {
+            *failure = "cannot create a pipe";
             return false;
         }
-        folder_ = mountAt != nullptr ? mountAt : folderTemplate;
+        unique_fd errRead(errPipe[0]), errWrite(errPipe[1]);
+        if (mountAt != nullptr) {
+            mount_ = mountAt;
+        }
         std::string program = std::string(ORVANE_BINARY_DIR) + "/orvane-devsim";
         pid_ = fork();
         if (pid_ == 0) {
             prctl(PR_SET_PDEATHSIG, SIGTERM);  // a crashed test leaves no mount behind
-            dup2(errPipe[1], STDERR_FILENO);
-            execl(program.c_str(), program.c_str(), folder_.c_str(), static_cast<char*>(nullptr));
+            dup2(errWrite.get(), STDERR_FILENO);
+            execl(program.c_str(), program.c_str(), mount_.c_str(), static_cast<char*>(nullptr));
             _exit(127);
         }
-        close(errPipe[1]);
+        errWrite.reset();
         auto mounted = [this] { return access(Path("qxev").c_str(), F_OK) == 0; };
         WaitUntil([&] { return mounted() || waitpid(pid_, nullptr, WNOHANG) == pid_; });
         bool ok = mounted();
         if (!ok) {
             char reason[512] = {};
-            fcntl(errPipe[0], F_SETFL, O_NONBLOCK);
-            ssize_t length = read(errPipe[0], reason, sizeof(reason) - 1);
+            fcntl(errRead.get(), F_SETFL, O_NONBLOCK);
+            ssize_t length = read(errRead.get(), reason, sizeof(reason) - 1);
             *failure = length > 0 ? std::string(reason, length) : "orvane-devsim did not start: " + program;
             Stop();
         }
-        close(errPipe[0]);
         return ok;
     }
     ~DevSim() { Stop(); }
 
-    std::string Path(const std::string& node) const { return folder_ + "/" + node; }
+    std::string Path(const std::string& node) const { return mount_ + "/" + node; }
 
     // One write, one record, as a driver queues it.
     bool Inject(const std::string& node, const std::string& record) const {
-        int fd = open(Path(node).c_str(), O_WRONLY | O_CLOEXEC);
-        bool written = fd >= 0 && write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
-        close(fd);
-        return written;
+        android::base::unique_fd fd(open(Path(node).c_str(), O_WRONLY | O_CLOEXEC));
+        return fd.ok() && write(fd.get(), record.data(), record.size()) == static_cast<ssize_t>(record.size());
     }
 
     // Unmounts; readers still blocked on a node then see their read fail.
@@ -68,14 +72,11 @@ public:
             waitpid(pid_, nullptr, 0);
             pid_ = -1;
         }
-        if (!folder_.empty()) {
-            rmdir(folder_.c_str());
-            folder_.clear();
-        }
     }
 
 private:
-    std::string folder_;
+    TemporaryDir folder_;
+    std::string mount_ = folder_.path;
     pid_t pid_ = -1;
 };
 

@@ -31,8 +31,8 @@ TEST(EventLogrelaySourceTest, MissingOrUnpollableNodeEndsOnlyThisSourceWithOneLi
     LogCapture logs;
     PacketFifo fifo;
     // A regular file cannot be watched by epoll, like a node whose driver has no poll support.
-    std::string plain = fifo.path + ".plain";
-    fclose(fopen(plain.c_str(), "w"));
+    TemporaryFile plainFile;
+    std::string plain = plainFile.path;
     FakePluginContext missing{"/tmp/", "/tmp/", {{"qxev", fifo.path}, {"qx_exception_log", fifo.path + ".absent"}}};
     FakePluginContext unpollable{"/tmp/", "/tmp/", {{"qx_exception_log", plain}}};
     // The kernel event source keeps running beside the relay sources that gave up.
@@ -46,7 +46,6 @@ TEST(EventLogrelaySourceTest, MissingOrUnpollableNodeEndsOnlyThisSourceWithOneLi
         SourceRunner relayRunner(relay);
         EXPECT_TRUE(WaitUntil([&] { return relayRunner.Finished(); }));
     }
-    unlink(plain.c_str());
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR, "openExceptionLogFd No kernel exception log monitor support (errno=2)"))
             << logs.Dump();
     EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR,
@@ -56,7 +55,7 @@ TEST(EventLogrelaySourceTest, MissingOrUnpollableNodeEndsOnlyThisSourceWithOneLi
     EXPECT_TRUE(radiatorRunner.Stop());
 }
 
-TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesUntilUnload) {
+TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesAcrossALostNode) {
     DevSim devsim;
     std::string failure;
     if (!devsim.Start(&failure)) {
@@ -64,8 +63,8 @@ TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesUnti
     }
     LogCapture logs;
     sp<EventLogrelaySource> relay = new EventLogrelaySource();
-    sp<RecordingPlugin> recorder = AttachRecorder(relay);
     FakePluginContext context{"/tmp/", "/tmp/", {{"qx_exception_log", devsim.Path("qx_exception_log")}}};
+    sp<RecordingPlugin> recorder = AttachRecorder(relay, &context);
     relay->SetPluginContext(&context);
     SourceRunner runner(relay);
     ASSERT_TRUE(logs.WaitFor(ANDROID_LOG_DEBUG, "threadLoop LogRelay start loop"));
@@ -81,11 +80,17 @@ TEST(EventLogrelaySourceTest, PriorityRecordsBecomeEventsInPiecesOf1023BytesUnti
     EXPECT_EQ(large.substr(1023), events[1]->GetValue("save_param_list"));
     EXPECT_EQ("oops at 0xdead\n", events[2]->GetValue("save_param_list"));
     EXPECT_FALSE(logs.Contains(ANDROID_LOG_ERROR, "epoll_wait")) << logs.Dump();
-    // A vanished node is ridden out (the failing waits end nothing); only the unload ends the loop.
+    // The node vanishes and comes back: the source reopens it, one line each way, and goes on.
     devsim.Stop();
-    EXPECT_FALSE(WaitUntil([&] { return runner.Finished(); }, std::chrono::milliseconds(200)));
+    ASSERT_TRUE(WaitUntil([&] { return context.stats_.Value("source.EventLogrelaySource.lost") == 1; }));
+    ASSERT_TRUE(devsim.Start(&failure)) << failure;
+    ASSERT_TRUE(devsim.Inject("qx_exception_log", "after the node came back"));
+    ASSERT_TRUE(WaitUntil([&] { return recorder->Count() == 4; }, std::chrono::seconds(20))) << recorder->Count();
+    EXPECT_EQ("after the node came back", recorder->Events().back()->GetValue("save_param_list"));
+    EXPECT_EQ(1u, context.stats_.Value("source.EventLogrelaySource.reopened"));
+    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_WARN, " lost")) << logs.Dump();
+    EXPECT_FALSE(runner.Finished());
     EXPECT_TRUE(runner.Stop());
-    EXPECT_EQ(3u, recorder->Count());
 }
 
 }  // namespace

@@ -9,8 +9,11 @@
 #include <sys/stat.h>
 
 #include <atomic>
-#include <mutex>
 #include <thread>
+
+#include <android-base/file.h>
+#include <android-base/unique_fd.h>
+#include <utils/Mutex.h>
 
 #include "platform/pipeline.h"
 #include "platform/plugin.h"
@@ -24,24 +27,26 @@ namespace android::Orvane {
 class RecordingPlugin : public Plugin {
 public:
     EVENT_RET OnEvent(sp<Event>& event) override {
-        std::lock_guard<std::mutex> guard(lock_);
+        Mutex::Autolock guard(lock_);
         events_.push_back(event);
         return 0;
     }
     std::vector<sp<Event>> Events() const {
-        std::lock_guard<std::mutex> guard(lock_);
+        Mutex::Autolock guard(lock_);
         return events_;
     }
     size_t Count() const { return Events().size(); }
 
 private:
-    mutable std::mutex lock_;
-    std::vector<sp<Event>> events_;
+    mutable Mutex lock_;
+    std::vector<sp<Event>> events_ GUARDED_BY(lock_);
 };
 
-// Connects a source to a pipeline holding only a new recorder.
-inline sp<RecordingPlugin> AttachRecorder(const sp<EventSource>& source) {
+// Connects a source to a pipeline holding only a new recorder; with a context the pipeline
+// counts into its statistics.
+inline sp<RecordingPlugin> AttachRecorder(const sp<EventSource>& source, PluginContext* context = nullptr) {
     sp<RecordingPlugin> recorder = new RecordingPlugin();
+    recorder->SetPluginContext(context);
     source->AddPipeline("dftFaultEvent", new Pipeline("dftFaultEvent", {recorder}));
     return recorder;
 }
@@ -50,20 +55,18 @@ inline sp<RecordingPlugin> AttachRecorder(const sp<EventSource>& source) {
 // write longer than 4096 bytes arrives as several reads of at most 4096 bytes.
 struct PacketFifo {
     PacketFifo() { mkfifo(path.c_str(), 0600); }
-    ~PacketFifo() {
-        close(writer);
-        unlink(path.c_str());
-    }
     // The first write opens the writer end, waiting for a reader; O_DIRECT is refused at open.
     bool Write(const std::string& record) {
-        if (writer < 0 && (writer = open(path.c_str(), O_WRONLY | O_CLOEXEC)) >= 0) {
-            fcntl(writer, F_SETFL, fcntl(writer, F_GETFL) | O_DIRECT);
+        if (!writer.ok()) {
+            writer.reset(open(path.c_str(), O_WRONLY | O_CLOEXEC));
+            fcntl(writer.get(), F_SETFL, fcntl(writer.get(), F_GETFL) | O_DIRECT);
         }
-        return write(writer, record.data(), record.size()) == static_cast<ssize_t>(record.size());
+        return write(writer.get(), record.data(), record.size()) == static_cast<ssize_t>(record.size());
     }
 
-    const std::string path = "/tmp/orvane-fifo-" + std::to_string(getpid()) + "-" + std::to_string(gettid());
-    int writer = -1;
+    TemporaryDir folder;
+    const std::string path = std::string(folder.path) + "/qxev";
+    android::base::unique_fd writer;
 };
 
 // Runs a source's StartEventSource on a thread of its own, as the platform does. The sources

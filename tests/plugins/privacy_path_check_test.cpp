@@ -103,19 +103,23 @@ TEST_F(PrivacyPathCheckTest, SwapsBetweenCheckAndOpenCannotPass) {
             rename(link.c_str(), path.c_str());
         }
     });
-    int opened = 0, leaked = 0;
-    for (int i = 0; i < 3000; ++i) {
+    // Until both kinds were met many times: the swapper may not even have run yet at the start.
+    int opened = 0, refused = 0, leaked = 0;
+    bool mixed = WaitUntil([&] {
         check_.IsPrivacycompliance(path);  // a check that passes says nothing about the open after it
         android::base::unique_fd fd = check_.OpenCompliantFile(path);
         if (fd.get() >= 0) {
             ++opened;
             leaked += Read(fd) == "secret" ? 1 : 0;
+        } else {
+            ++refused;
         }
-    }
+        return opened >= 500 && refused >= 500;
+    });
     done = true;
     swapper.join();
     EXPECT_EQ(leaked, 0);
-    EXPECT_GT(opened, 0);
+    EXPECT_TRUE(mixed) << opened << " opened, " << refused << " refused";
 
     // Packed from the descriptor: the file that was judged and opened, whatever the path names now.
     ASSERT_TRUE(WriteStringToFile("log line", plain));

@@ -6,9 +6,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <filesystem>
 #include <fstream>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -28,10 +28,7 @@ protected:
             GTEST_SKIP() << "the daemon or the device emulator is unavailable: " << failure;
         std::ofstream(folder_ + "/properties") << "ro.quor.build.region=CN\n";
     }
-    void TearDown() override {
-        StopDaemon();
-        std::filesystem::remove_all(folder_);
-    }
+    void TearDown() override { StopDaemon(); }
 
     // Starts the daemon with the shipped configuration. The nodes queue what is written before it reads.
     void StartDaemon(const std::string& devList) {
@@ -74,7 +71,8 @@ protected:
     }
 
     DevSim devsim_;
-    std::string folder_ = mkdtemp(std::string("/tmp/orvane-chain-XXXXXX").data());
+    TemporaryDir root_;
+    const std::string folder_ = root_.path;
     pid_t daemon_ = -1;
 };
 

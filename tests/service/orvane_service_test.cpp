@@ -5,12 +5,13 @@
 
 #include <atomic>
 #include <filesystem>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
+#include <utils/Mutex.h>
 
 #include "host/service/host_binder_server.h"
 #include "platform/plugin_factory.h"
@@ -26,17 +27,17 @@ namespace {
 constexpr uid_t kSystemUid = 1000;
 
 // What the stand-in plugins and listener received, from their loops.
-std::mutex gMutex;
-std::vector<sp<Event>> gEvents;
+Mutex gMutex;
+std::vector<sp<Event>> gEvents GUARDED_BY(gMutex);
 std::atomic<int> gPackResult{0};
 
 void Keep(const sp<Event>& event) {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     gEvents.push_back(event);
 }
 
 std::vector<sp<Event>> EventsOf(uint32_t eventId) {
-    std::lock_guard<std::mutex> lock(gMutex);
+    Mutex::Autolock lock(gMutex);
     std::vector<sp<Event>> found;
     std::copy_if(gEvents.begin(), gEvents.end(), std::back_inserter(found),
                  [&](const sp<Event>& e) { return e->eventId == eventId; });
@@ -90,20 +91,19 @@ protected:
     }
     void SetUp() override {
         ASSERT_NE(dynamic_cast<StandIn<true>*>(PluginFactory::CreatePlugin("EventLogProcessor").get()), nullptr);
-        chmod(root_.c_str(), 0755);  // reachable for the unprivileged orvanectl
-        std::lock_guard<std::mutex> lock(gMutex);
+        chmod(root_.path, 0755);  // reachable for the unprivileged orvanectl
+        Mutex::Autolock lock(gMutex);
         gEvents.clear();
     }
     void TearDown() override {
         if (server_ != nullptr)
             server_->Stop();
         delete platform_;
-        std::filesystem::remove_all(root_);
     }
 
     // Starts the platform, and a server unless checkCaller is negative.
     void Start(const char* config, int checkCaller) {
-        std::string configDir = root_ + "/etc/", cloudDir = root_ + "/cloud/";
+        std::string configDir = Root() + "/etc/", cloudDir = Root() + "/cloud/";
         ASSERT_TRUE(FileUtil::CreateDirectory(configDir, 0775));
         ASSERT_TRUE(FileUtil::SaveStringToFile(configDir + "plugin_config", config, true));
         const char* argv[] = {"orvane",         "-configDir",   configDir.c_str(), "-workDir",
@@ -115,7 +115,7 @@ protected:
         chmod(workDir_.c_str(), 0755);
         if (checkCaller < 0)
             return;
-        server_ = new HostBinderServer(HostBinderServer::Options());
+        server_ = new HostBinderServer(platform_->GetStats());
         ASSERT_TRUE(server_->AddService(SocketPath(),
                                         new OrvaneNativeService(new OrvaneService(platform_), checkCaller != 0)));
         ASSERT_EQ(chown(SocketPath().c_str(), -1, kSystemUid), 0);
@@ -140,7 +140,11 @@ protected:
         return output;
     }
 
-    std::string root_ = mkdtemp(std::string("/tmp/orvane_service_testXXXXXX").data()), workDir_ = root_ + "/work/";
+    std::string Root() const { return root_.path; }
+    uint64_t Counted(const char* name) const { return platform_->GetStats().Value(name); }
+
+    TemporaryDir root_;
+    std::string workDir_ = Root() + "/work/";
     PluginPlatform* platform_ = nullptr;
     sp<HostBinderServer> server_;
 };
@@ -159,12 +163,13 @@ TEST_F(OrvaneServiceTest, CommandsReachTheirTargetsOnlyFromTheCompanion) {
     EXPECT_EQ(Ctl({"dump", "plugin", "NoSuchPlugin"}, 0), "plugin NoSuchPlugin not exist");
 
     // Refused callers get an OK reply, but nothing is done.
-    for (uid_t uid : {0, 2000}) {
+    for (uid_t uid : {2000, 0})
         Ctl({"upload-switch", "on"}, uid);
-        EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "CanProcess not suport calling_uid " + std::to_string(uid)));
-    }
+    EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "CanProcess not suport calling_uid 2000"));
+    EXPECT_EQ(Counted("service.refused.uid"), 2u);
     Ctl({"user-activated"}, kSystemUid, "other.process");
     EXPECT_TRUE(log.Contains(ANDROID_LOG_INFO, "CanProcess not suport process")) << log.Dump();
+    EXPECT_EQ(Counted("service.refused.process"), 1u);
 
     gPackResult = 7;
     EXPECT_EQ(Ctl({"pack-log"}), "7\n");
@@ -177,8 +182,8 @@ TEST_F(OrvaneServiceTest, CommandsReachTheirTargetsOnlyFromTheCompanion) {
     EXPECT_EQ(EventsOf(103)[0]->GetValue("EVENT_UE_UPDATE"), "1");     // one loop keeps their order
     EXPECT_EQ(EventsOf(103)[1]->GetValue("EVENT_UE_UPDATE"), "0");
     EXPECT_TRUE(EventsOf(105).empty());  // nor from the other process
-    Ctl({"config-update", root_ + "/pushed"});
-    EXPECT_EQ(platform_->GetCloudConfigDir(), root_ + "/pushed/");
+    Ctl({"config-update", Root() + "/pushed"});
+    EXPECT_EQ(platform_->GetCloudConfigDir(), Root() + "/pushed/");
     ASSERT_TRUE(WaitUntil([] { return EventsOf(104).size() == 1; }));
     Ctl({"user-activated"});
     ASSERT_TRUE(WaitUntil([] { return EventsOf(105).size() == 1; }));

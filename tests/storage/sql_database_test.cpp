@@ -3,17 +3,24 @@
 
 #include "storage/sql_database.h"
 
+#include <dirent.h>
 #include <sqlite3.h>
+#include <unistd.h>
 
 #include <atomic>
+#include <filesystem>
+#include <thread>
 
 #include <gtest/gtest.h>
 
 #include "storage/event_database.h"
+#include "storage/event_database_helper.h"
 #include "storage/event_query.h"
 #include "storage/event_table.h"
+#include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
 #include "tests/storage/storage_test_util.h"
+#include "utils/time_util.h"
 
 namespace android::Orvane {
 
@@ -156,6 +163,39 @@ protected:
     sp<BaseTable> raw_ = new RawEventTable();
 };
 
+// The event store on files that were damaged, replaced by a link, or sit on a full disk.
+class HostileFileTest : public ::testing::Test {
+protected:
+    void SetUp() override { FaultyVfs::Install(); }
+    void TearDown() override { FaultyVfs::Heal(), EventDatabase::getInstance()->Close(); }
+    bool Init() {
+        EventDatabase::getInstance()->Close();
+        helper_ = new EventDatabaseHelper();
+        return helper_->Init(&context_, "event.db", "OS3");
+    }
+    // Events of distinct ids, which no quota or pacing rule drops.
+    void Store(int n, const std::string& tag) {
+        for (int i = 0; i < n; i++)
+            helper_->ProcessFaultEvent(MakeEvent(2, 902000000 + i, now_ - 100 + i, tag + std::to_string(i)));
+    }
+    // The files of the work folder but the database itself, by name.
+    Texts Others() {
+        Texts names;
+        for (const auto& entry : std::filesystem::directory_iterator(dir_.path_))
+            if (entry.path().filename() != "event.db")
+                names.push_back(entry.path().filename());
+        std::sort(names.begin(), names.end());
+        return names;
+    }
+    uint64_t Stat(const std::string& name) { return context_.GetStats().Value(name); }
+
+    TempDir dir_;
+    std::string path_ = dir_.File("event.db");
+    FakePluginContext context_{dir_.path_, dir_.path_};
+    sp<EventDatabaseHelper> helper_;
+    uint64_t now_ = TimeUtil::GetTimestampSecond();
+};
+
 TEST_F(SqlFileTest, OldFileIsUpgradedOnce) {
     ASSERT_TRUE(db_->ExecuteSql(
             "create table event_daily(id INTEGER NOT NULL PRIMARY KEY AUTOINCREMENT,event_id INTEGER NOT NULL,"
@@ -197,6 +237,107 @@ TEST_F(SqlFileTest, FileThatIsNoDatabaseFailsLoudlyAndIsLeftAlone) {
     EXPECT_TRUE(log.Contains(ANDROID_LOG_WARN, "ExecuteSql failed execute sql " + path_ +
                                                        ", err:file is not a database, sql:create table t(a INTEGER)"));
     EXPECT_EQ(ReadFile(path_), garbage);
+}
+
+// A file that is no database, lost its end or has a page of garbage is moved aside (one copy, the
+// newest), a fresh database with its version rows takes its place, and the event at hand is stored.
+TEST_F(HostileFileTest, CorruptFileIsMovedAsideAndStoringGoesOn) {
+    size_t eventInfoPage = 0;  // the root page of event_info, which every event's lookup reads
+    const std::string badPage(4096, 'X');
+    const std::pair<std::function<void(std::string&)>, std::string> damages[] = {
+            {[](std::string& file) { file = "this is no database" + std::string(8192, 'Z'); }, "this is no database"},
+            {[](std::string& file) { file.resize(file.size() / 2); }, "SQLite format 3"},
+            {[&](std::string& file) { file.replace((eventInfoPage - 1) * 4096, 4096, badPage); }, badPage},
+    };
+    LogCapture log;
+    uint64_t recovered = 0;
+    for (const auto& [damage, mark] : damages) {
+        ASSERT_TRUE(Init());
+        Store(200, "stored before the damage ");
+        EventDatabase::getInstance()->Close();
+        eventInfoPage = std::stoul(Column(path_, "select rootpage from sqlite_master where name = 'event_info'")[0]);
+        std::string file = ReadFile(path_);
+        damage(file);
+        WriteFile(path_, file);
+        WriteFile(path_ + ".corrupt-20200101000000", "an older copy");
+        Init();
+        Store(1, "after ");
+        recovered++;
+        EXPECT_EQ(Column(path_, "select param_list from event_info"), Texts{"after 0"}) << mark;
+        EXPECT_EQ(Column(path_, "select (select count(*) from version)||'/'||(select count(*) from db_version)"),
+                  Texts{"1/1"});
+        Texts others = Others();
+        ASSERT_EQ(others.size(), 1u) << others[0];
+        EXPECT_EQ(others[0].rfind("event.db.corrupt-" + TimeUtil::GetTimeDateStr(now_, "%Y%m%d"), 0), 0u);
+        std::string copy = ReadFile(dir_.File(others[0]));
+        EXPECT_TRUE(copy.size() == file.size() && copy.find(mark) != std::string::npos) << "no damaged copy";
+        EXPECT_EQ(Stat("storage.db.recovered"), recovered);
+        EXPECT_EQ(Stat("storage.events.store_failed"), 0u);
+        std::filesystem::remove(dir_.File(others[0]));
+        std::filesystem::remove(path_);
+    }
+    // One line as worded; the recoveries that follow within seconds are collapsed into a count.
+    EXPECT_EQ(log.Count(ANDROID_LOG_ERROR, "MoveAside db " + path_ + " is corrupt ("), 1u);
+}
+
+// A database name that is a link is refused, whether the link points at nothing or at a database.
+TEST_F(HostileFileTest, SymbolicLinkIsRefused) {
+    TempDir elsewhere;
+    const std::string target = elsewhere.File("target.db");
+    ASSERT_EQ(symlink(target.c_str(), path_.c_str()), 0);
+    LogCapture log;
+    EXPECT_FALSE(Init());
+    Store(1, "");
+    EXPECT_FALSE(std::filesystem::exists(target));
+    {
+        sp<SqlDatabase> real = new SqlDatabase(target);
+        ASSERT_TRUE(real->Open() && real->ExecuteSql("create table t(a INTEGER)"));
+        real->Close();
+    }
+    std::string content = ReadFile(target);
+    EXPECT_FALSE(Init());
+    Store(1, "");
+    EXPECT_EQ(ReadFile(target), content);
+    EXPECT_EQ(log.Count(ANDROID_LOG_ERROR, "InitDatabase refusing db " + path_ + ", it is a symbolic link"), 2u)
+            << log.Dump();
+    EXPECT_EQ(Stat("storage.db.link_refused"), 2u);
+}
+
+// On a full disk every statement fails: the failures are counted, and their lines collapsed (the
+// wording of the first is checked with the file that is no database).
+TEST_F(HostileFileTest, FullDiskFailuresAreLoggedOnceAndCounted) {
+    ASSERT_TRUE(Init());
+    Store(1, "stored ");
+    LogCapture log;
+    FaultyVfs::writeBudget = 0;
+    Store(100, "lost ");
+    size_t failures = 0;
+    for (const auto& line : log.Lines())
+        failures += line.priority >= ANDROID_LOG_WARN ? 1 : 0;
+    // At most the first failed statement (unless a test before this one in the process just logged one)
+    // and the first lost event's insert.
+    EXPECT_LE(failures, 2u) << log.Dump();
+    EXPECT_LE(log.Count(ANDROID_LOG_WARN, "ExecuteSql failed execute sql " + path_ + ", err:database or disk is full"),
+              1u);
+    EXPECT_EQ(Stat("storage.events.store_failed"), 100u);
+    EXPECT_GE(Stat("storage.db.errors"), 200u);
+    FaultyVfs::Heal();
+    Store(1, "space is back ");
+    EXPECT_EQ(Column(path_, "select count(*) from event_info"), Texts{"2"});
+}
+
+// Only the thread that holds the event database may use it; Close hands it over.
+TEST_F(HostileFileTest, DatabaseBelongsToOneThreadAtATime) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    ASSERT_TRUE(Init());
+    EXPECT_DEATH(std::thread([this] { Store(1, ""); }).join(), "called on thread");
+    EventDatabase::getInstance()->Close();
+    std::thread([this] {
+        EXPECT_TRUE(Init());
+        Store(1, "from another thread");
+        EventDatabase::getInstance()->Close();
+    }).join();
+    EXPECT_EQ(Column(path_, "select param_list from event_info"), Texts{"from another thread0"});
 }
 
 TEST_F(SqlFileTest, ReadOnlyOrFullDiskLosesNoCommittedRow) {

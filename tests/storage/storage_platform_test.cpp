@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <atomic>
 
+#include <android-base/unique_fd.h>
 #include <gtest/gtest.h>
 
 #include "platform/plugin_factory.h"
@@ -90,13 +91,13 @@ TEST_F(StoragePlatformTest, FaultEventsAreCountedDroppedAndStored) {
 }
 
 TEST_F(StoragePlatformTest, KillDuringAStreamKeepsEveryStoredRow) {
-    int acks[2];
-    ASSERT_EQ(pipe(acks), 0);
+    base::unique_fd ackRead, ackWrite;
+    ASSERT_TRUE(base::Pipe(&ackRead, &ackWrite));
     pid_t child = fork();
     ASSERT_GE(child, 0);
     if (child == 0) {  // the daemon: stores a stream of events as fast as it can until it is killed
-        close(acks[0]);
-        StorageTestSource::ackFd_ = acks[1];
+        ackRead.reset();
+        StorageTestSource::ackFd_ = ackWrite.get();
         StartPlatform();
         for (int i = 0; i < 100000; i++) {
             Publish(901003003, day_ + 60 + i % 3600, std::to_string(i));
@@ -106,17 +107,17 @@ TEST_F(StoragePlatformTest, KillDuringAStreamKeepsEveryStoredRow) {
         sleep(60);  // waits for the kill, bounded in case the parent is gone
         _exit(0);
     }
-    close(acks[1]);
+    ackWrite.reset();
     // Kills the daemon once 100 events are acknowledged, then reads what was on its way.
     std::string acked;
     char buffer[4096];
     bool killed = false;
-    for (ssize_t size; (size = read(acks[0], buffer, sizeof(buffer))) > 0;) {
+    for (ssize_t size; (size = read(ackRead.get(), buffer, sizeof(buffer))) > 0;) {
         acked.append(buffer, static_cast<size_t>(size));
         if (!killed && std::count(acked.begin(), acked.end(), '\n') >= 100)
             killed = kill(child, SIGKILL) == 0;
     }
-    close(acks[0]);
+    ackRead.reset();
     kill(child, SIGKILL);
     int status = 0;
     waitpid(child, &status, 0);

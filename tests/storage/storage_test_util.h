@@ -1,15 +1,12 @@
 #ifndef ORVANE_TESTS_STORAGE_STORAGE_TEST_UTIL_H
 #define ORVANE_TESTS_STORAGE_STORAGE_TEST_UTIL_H
 
-#include <stdio.h>
-#include <stdlib.h>
+#include <sqlite3.h>
+#include <unistd.h>
 
-#include <filesystem>
-#include <fstream>
 #include <functional>
-#include <iterator>
-#include <sstream>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "platform/event.h"
@@ -21,18 +18,19 @@ using Texts = std::vector<std::string>;
 
 // A fresh folder for one test, removed with everything in it afterwards.
 struct TempDir {
-    ~TempDir() { std::filesystem::remove_all(path_); }
     std::string File(const std::string& name) const { return path_ + name; }
-    std::string path_ = mkdtemp(std::string("/tmp/orvane_storage_XXXXXX").data()) + std::string("/");
+    TemporaryDir dir_;
+    std::string path_ = std::string(dir_.path) + "/";
 };
 
 inline std::string ReadFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return {std::istreambuf_iterator<char>(in), {}};
+    std::string content;
+    base::ReadFileToString(path, &content);
+    return content;
 }
 
 inline void WriteFile(const std::string& path, const std::string& content) {
-    std::ofstream(path, std::ios::binary) << content;
+    ASSERT_TRUE(base::WriteStringToFile(content, path)) << path;
 }
 
 inline sp<Event> MakeEvent(uint32_t type, uint32_t id, uint64_t happenTime, const std::string& params = "p") {
@@ -44,23 +42,37 @@ inline sp<Event> MakeEvent(uint32_t type, uint32_t id, uint64_t happenTime, cons
 
 // What a dump command writes to its descriptor.
 inline std::string DumpOf(const std::function<void(int)>& dump) {
-    FILE* file = tmpfile();
-    dump(fileno(file));
-    std::string out = ReadFile("/proc/self/fd/" + std::to_string(fileno(file)));
-    fclose(file);
+    TemporaryFile file;
+    dump(file.fd);
+    std::string out;
+    lseek(file.fd, 0, SEEK_SET);
+    base::ReadFdToString(file.fd, &out);
     return out;
 }
 
-// Runs SQL on a connection of its own, outside the code under test: the values of the first column.
+// Runs SQL on a connection of its own, outside the code under test: the values of the first
+// column. It waits for the locks of other connections like any reader that means no harm.
 inline Texts Column(const std::string& path, const std::string& sql) {
-    sp<SqlDatabase> db = new SqlDatabase(path);
-    EXPECT_TRUE(db->Open());
+    sqlite3* db = nullptr;
     Texts values;
-    for (auto& row : db->QueryRecord(sql, {"v"}))
-        values.push_back(row["v"]);
-    EXPECT_EQ(db->GetLastError(), "") << sql;
-    db->Close();
+    EXPECT_EQ(sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr), SQLITE_OK) << path;
+    sqlite3_busy_timeout(db, 20000);
+    auto append = [](void* out, int, char** row, char**) {
+        static_cast<Texts*>(out)->push_back(row[0] != nullptr ? row[0] : "");
+        return 0;
+    };
+    char* error = nullptr;
+    EXPECT_EQ(sqlite3_exec(db, sql.c_str(), append, &values, &error), SQLITE_OK) << sql << ": " << error;
+    sqlite3_free(error);
+    sqlite3_close(db);
     return values;
+}
+
+// Bytes of the pages that hold data, as a vacuum would leave them.
+inline int64_t LiveSize(const std::string& path) {
+    return std::stoll(Column(path,
+                             "select (page_count - freelist_count) * page_size from pragma_page_count, "
+                             "pragma_freelist_count, pragma_page_size")[0]);
 }
 
 }  // namespace android::Orvane

@@ -22,7 +22,9 @@ protected:
         }
     }
 
-    int Open(const std::string& node, int flags) { return open(devsim_.Path(node).c_str(), flags | O_CLOEXEC); }
+    android::base::unique_fd Open(const std::string& node, int flags) {
+        return android::base::unique_fd(open(devsim_.Path(node).c_str(), flags | O_CLOEXEC));
+    }
 
     static std::string ReadRecord(int fd, size_t size = 4096) {
         std::string buffer(size, '\0');
@@ -40,8 +42,9 @@ protected:
 };
 
 TEST_F(DevSimTest, OneRecordPerReadAndAFullQueueLosesNothing) {
-    int reader = Open("qxev", O_RDONLY);
-    ASSERT_GE(reader, 0);
+    android::base::unique_fd file = Open("qxev", O_RDONLY);
+    ASSERT_TRUE(file.ok());
+    int reader = file.get();
     EXPECT_EQ(0, Ready(reader, 0));
     ASSERT_TRUE(devsim_.Inject("qxev", "first record"));
     ASSERT_TRUE(devsim_.Inject("qxev", "second"));
@@ -73,7 +76,6 @@ TEST_F(DevSimTest, OneRecordPerReadAndAFullQueueLosesNothing) {
     EXPECT_EQ(EINTR, errno);
     ASSERT_TRUE(devsim_.Inject("qxev", "after the interrupt"));
     EXPECT_EQ("after the interrupt", ReadRecord(reader));
-    close(reader);
 }
 
 TEST(DevSimMountTest, UnmountableFolderIsReportedInOneLine) {

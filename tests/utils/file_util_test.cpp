@@ -6,6 +6,8 @@
 
 #include <cstdlib>
 
+#include <android-base/file.h>
+#include <android-base/unique_fd.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -17,9 +19,7 @@ const mode_t kOldMask = umask(022);  // so that no mode checked below can come f
 
 class FileUtilTest : public testing::Test {
 protected:
-    void SetUp() override { ASSERT_NE(nullptr, mkdtemp(root_)); }
-    void TearDown() override { ASSERT_EQ(0, system(("rm -rf '" + Path("") + "'").c_str())); }
-    std::string Path(const std::string& name) const { return std::string(root_) + "/" + name; }
+    std::string Path(const std::string& name) const { return std::string(root_.path) + "/" + name; }
     static uint64_t Stat(const std::string& path, bool mode) {
         struct stat st;
         return lstat(path.c_str(), &st) != 0 ? 0 : mode ? (st.st_mode & 07777) : st.st_size;
@@ -29,7 +29,7 @@ protected:
         LoadStringFromFile(path, content);
         return content;
     }
-    char root_[32] = "/tmp/orvane_file_util_XXXXXX";
+    TemporaryDir root_;
 };
 
 TEST_F(FileUtilTest, CreateDirectoryGivesTheModeOnlyToFoldersItCreates) {
@@ -56,15 +56,16 @@ TEST_F(FileUtilTest, CreateDirectoryGivesTheModeOnlyToFoldersItCreates) {
 TEST_F(FileUtilTest, LoadLimitNulTrimmingAndSaveModes) {
     const std::string big = Path("big");
     constexpr off_t kLimit = 32 << 20;
-    int fd = open(big.c_str(), O_RDWR | O_CREAT, 0644);
+    android::base::unique_fd fd(open(big.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
     // Sparse, so it costs no disk; markers at both ends prove the whole file was read.
     ASSERT_TRUE(fd >= 0 && ftruncate(fd, kLimit) == 0 && pwrite(fd, "A", 1, 0) + pwrite(fd, "Z", 1, kLimit - 1) == 2);
     std::string content = Load(big);
     EXPECT_TRUE(content.size() == size_t{kLimit} && content.front() == 'A' && content.back() == 'Z') << content.size();
-    ASSERT_TRUE(ftruncate(fd, kLimit + 1) == 0 && close(fd) == 0);
+    ASSERT_EQ(ftruncate(fd, kLimit + 1), 0);
     EXPECT_EQ("<failed>", Load(big));  // refused, content untouched
-    // Files of /proc measure 0 bytes, yet have content.
+    // Files of /proc measure 0 bytes, yet have content; most of them cannot even seek to their end.
     EXPECT_NE(std::string::npos, Load("/proc/self/cmdline").find("file_util_test"));
+    EXPECT_EQ(0u, Load("/proc/self/status").find("Name:"));
 
     const std::string file = Path("save");
     ASSERT_TRUE(SaveStringToFile(file, std::string("\0\0one\0", 6), true) &&

@@ -11,7 +11,8 @@ TEST(JsonUtilTest, ParsedTextAndMapWriteOneLineAndBadInputIsRefused) {
     ASSERT_TRUE(JsonUtil::ConvertStrToJson(R"({"id":901001001,"list":[1,2]})", value));
     LogCapture logs;
     EXPECT_FALSE(JsonUtil::ConvertStrToJson(R"({"id":)", bad) || JsonUtil::ConvertStrToJson("", bad));
-    EXPECT_EQ(2u, logs.Count(ANDROID_LOG_ERROR, "ConvertStrToJson json convert failed ")) << logs.Dump();
+    // Outside input can repeat the line: the second within the window is only counted.
+    EXPECT_EQ(1u, logs.Count(ANDROID_LOG_ERROR, "ConvertStrToJson json convert failed ")) << logs.Dump();
 
     std::map<std::string, std::string> map = {{"b", "2"}, {"a", "x\"y\nz"}, {"empty", ""}};
     ASSERT_TRUE(JsonUtil::ConvertMapToJson(map, value));

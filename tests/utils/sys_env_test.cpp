@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <vector>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -17,11 +18,10 @@ namespace android::Orvane {
 // The store reads ORVANE_PROPERTY_FILE once, at its first use, so the file is chosen during
 // static initialisation; the helper process (ORVANE_SYS_ENV_HELPER set) inherits its parent's.
 std::string ChooseFile() {
-    static char dir[] = "/tmp/orvane_sys_env_XXXXXX";
     if (getenv("ORVANE_SYS_ENV_HELPER") == nullptr) {
-        // Without a usable folder every test fails.
-        setenv("ORVANE_PROPERTY_FILE", ((mkdtemp(dir) ? dir : "/none") + std::string("/build.prop")).c_str(), 1);
-        atexit([] { system(("rm -rf '" + std::string(dir) + "'").c_str()); });  // also when no test runs
+        // Removed with the process, also when no test runs; without it every test fails.
+        static TemporaryDir dir;
+        setenv("ORVANE_PROPERTY_FILE", (std::string(dir.path) + "/build.prop").c_str(), 1);
     }
     return getenv("ORVANE_PROPERTY_FILE");
 }

@@ -4,7 +4,9 @@
 #include <fstream>
 #include <iterator>
 #include <memory>
+#include <thread>
 
+#include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
@@ -28,12 +30,7 @@ std::vector<std::string> ListEntries(const std::string& zipPath) {
 
 class ZipPackTest : public testing::Test {
 protected:
-    void SetUp() override {
-        char pattern[] = "/tmp/zip_pack_test.XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        dir_ = pattern, zip_ = dir_ + "/out.zip";
-    }
-    void TearDown() override { ASSERT_EQ(0, system(("rm -rf '" + dir_ + "'").c_str())); }
+    void SetUp() override {}
     // count files "f<i>.log" whose content names them.
     std::vector<std::string> MakeFiles(int count) {
         std::vector<std::string> paths;
@@ -62,7 +59,9 @@ protected:
         return reader_.Open(dir_ + "/other.zip");
     }
 
-    std::string dir_, zip_, content_;
+    TemporaryDir tmp_;
+    const std::string dir_ = tmp_.path, zip_ = dir_ + "/out.zip";
+    std::string content_;
     int calls_ = 0;
     ZipReader reader_;
 };
@@ -148,6 +147,27 @@ TEST_F(ZipPackTest, FailedFilesDirectoriesAndReadBack) {
     ASSERT_TRUE(Reopen(archive));
     EXPECT_FALSE(Extract(files[1].substr(1)));  // inflate or checksum fails
     EXPECT_TRUE(Extract(files[0].substr(1)) && content_ == "line of file 0\n") << content_;
+}
+
+// minizip's handles are not thread-safe: a second thread using a pack or reader before its owner
+// closed it dies; after Close another thread may take it over.
+TEST_F(ZipPackTest, PacksAndReadersBelongToOneThreadUntilClosed) {
+    std::vector<std::string> files = MakeFiles(1);
+    ZipPack pack;
+    ASSERT_TRUE(pack.CreateZip(zip_));
+    EXPECT_DEATH(std::thread([&] { pack.AddFiles(files); }).join(), "AddFiles called on thread [0-9]+, owned by");
+    pack.Close();
+    std::thread([&] {
+        ASSERT_TRUE(pack.CreateZip(zip_) && pack.AddFiles(files));
+        pack.Close();
+    }).join();
+    ASSERT_TRUE(reader_.Open(zip_));
+    EXPECT_DEATH(std::thread([&] { Extract(files[0].substr(1)); }).join(), "ExtractFile called on thread");
+    reader_.Close();
+    std::thread([&] {
+        EXPECT_TRUE(reader_.Open(zip_) && Extract(files[0].substr(1)) && content_ == "line of file 0\n");
+        reader_.Close();
+    }).join();
 }
 
 }  // namespace android::Orvane

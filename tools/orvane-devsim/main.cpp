@@ -12,9 +12,11 @@
 #include <unistd.h>
 
 #include <iostream>
-#include <mutex>
 #include <string>
 #include <unordered_set>
+
+#include <android-base/unique_fd.h>
+#include <utils/Mutex.h>
 
 #include "record_node.h"
 
@@ -145,8 +147,8 @@ void DoPoll(fuse_req_t req, fuse_ino_t ino, fuse_file_info*, fuse_pollhandle* ph
 // The low-level API has no field for FOPEN_STREAM, so open replies get it on the wire. Without
 // it the kernel serialises reads and writes on one shared descriptor through the file position
 // lock, and a held read would block a writer using the same descriptor.
-std::mutex gOpenLock;
-std::unordered_set<uint64_t> gPendingOpens;  // unique ids of open requests not answered yet
+android::Mutex gOpenLock;
+std::unordered_set<uint64_t> gPendingOpens GUARDED_BY(gOpenLock);  // unique ids of open requests not answered yet
 
 ssize_t WireRead(int fd, void* buffer, size_t length, void*) {
     ssize_t received = read(fd, buffer, length);
@@ -154,7 +156,7 @@ ssize_t WireRead(int fd, void* buffer, size_t length, void*) {
         fuse_in_header header;
         memcpy(&header, buffer, sizeof(header));
         if (header.opcode == FUSE_OPEN) {
-            std::lock_guard<std::mutex> guard(gOpenLock);
+            android::Mutex::Autolock guard(gOpenLock);
             gPendingOpens.insert(header.unique);
         }
     }
@@ -166,7 +168,7 @@ ssize_t WireWritev(int fd, iovec* iov, int count, void*) {
     memcpy(&header, iov[0].iov_base, sizeof(header));
     bool pendingOpen;
     {
-        std::lock_guard<std::mutex> guard(gOpenLock);
+        android::Mutex::Autolock guard(gOpenLock);
         pendingOpen = gPendingOpens.erase(header.unique) > 0;
     }
     if (pendingOpen && header.error == 0 && count > 1 && iov[1].iov_len == sizeof(fuse_open_out)) {
@@ -257,8 +259,8 @@ bool WriteRecord(int fd, const std::string& record) {
 // lines of standard input, one record each (without the line feed).
 int Inject(const std::string& folder, const std::string& node, char** records, int count) {
     std::string path = folder + "/" + node;
-    int fd = open(path.c_str(), O_WRONLY | O_CLOEXEC);
-    if (fd < 0) {
+    android::base::unique_fd fd(open(path.c_str(), O_WRONLY | O_CLOEXEC));
+    if (!fd.ok()) {
         fprintf(stderr, "orvane-devsim: cannot open %s: %s\n", path.c_str(), strerror(errno));
         return 1;
     }
@@ -266,17 +268,16 @@ int Inject(const std::string& folder, const std::string& node, char** records, i
     for (int index = 0; index < count && rc == 0; ++index) {
         std::string record = records[index];
         if (record != "-") {
-            rc = WriteRecord(fd, record) ? 0 : 1;
+            rc = WriteRecord(fd.get(), record) ? 0 : 1;
             continue;
         }
         while (rc == 0 && std::getline(std::cin, record)) {
-            rc = WriteRecord(fd, record) ? 0 : 1;
+            rc = WriteRecord(fd.get(), record) ? 0 : 1;
         }
     }
     if (rc != 0) {
         fprintf(stderr, "orvane-devsim: write to %s failed: %s\n", path.c_str(), strerror(errno));
     }
-    close(fd);
     return rc;
 }
 

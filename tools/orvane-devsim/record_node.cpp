@@ -13,13 +13,13 @@ void RecordNode::Read(fuse_req_t req, size_t size) {
     // Registered before taking the lock: libfuse may run the callback at once, and it takes
     // the lock itself. A request interrupted before it was queued is caught just below.
     fuse_req_interrupt_func(req, OnInterrupt, this);
-    std::lock_guard<std::mutex> guard(lock);
+    android::Mutex::Autolock guard(lock_);
     if (fuse_req_interrupted(req)) {
         fuse_reply_err(req, EINTR);
         return;
     }
-    if (records.empty()) {
-        heldReads.push_back({req, size});
+    if (records_.empty()) {
+        heldReads_.push_back({req, size});
         return;
     }
     ReplyWithHead(req, size);
@@ -32,24 +32,24 @@ void RecordNode::Write(fuse_req_t req, const char* data, size_t size) {
         return;
     }
     fuse_req_interrupt_func(req, OnInterrupt, this);
-    std::lock_guard<std::mutex> guard(lock);
+    android::Mutex::Autolock guard(lock_);
     if (fuse_req_interrupted(req)) {
         fuse_reply_err(req, EINTR);
         return;
     }
     // Held writes keep their order: a new record never overtakes one that is waiting for room.
-    heldWrites.push_back({req, std::string(data, size)});
+    heldWrites_.push_back({req, std::string(data, size)});
     Settle();
 }
 
 void RecordNode::Poll(fuse_req_t req, fuse_pollhandle* ph) {
-    std::lock_guard<std::mutex> guard(lock);
+    android::Mutex::Autolock guard(lock_);
     unsigned events = ReadyEvents();
     if (ph != nullptr) {
         // A poller that is answered ready now needs no later wake-up; one that waits for a
         // record or for room is woken by the next change of the queue.
-        if (records.empty() || records.size() >= capacity) {
-            pollers.push_back(ph);
+        if (records_.empty() || records_.size() >= capacity_) {
+            pollers_.push_back(ph);
         } else {
             fuse_pollhandle_destroy(ph);
         }
@@ -58,15 +58,15 @@ void RecordNode::Poll(fuse_req_t req, fuse_pollhandle* ph) {
 }
 
 void RecordNode::Shutdown() {
-    std::lock_guard<std::mutex> guard(lock);
-    for (const HeldRead& held : heldReads) {
+    android::Mutex::Autolock guard(lock_);
+    for (const HeldRead& held : heldReads_) {
         fuse_reply_err(held.req, ENODEV);
     }
-    for (const HeldWrite& held : heldWrites) {
+    for (const HeldWrite& held : heldWrites_) {
         fuse_reply_err(held.req, ENODEV);
     }
-    heldReads.clear();
-    heldWrites.clear();
+    heldReads_.clear();
+    heldWrites_.clear();
     NotifyPollers();
 }
 
@@ -75,18 +75,18 @@ void RecordNode::OnInterrupt(fuse_req_t req, void* node) {
 }
 
 void RecordNode::Interrupt(fuse_req_t req) {
-    std::lock_guard<std::mutex> guard(lock);
+    android::Mutex::Autolock guard(lock_);
     auto read =
-            std::find_if(heldReads.begin(), heldReads.end(), [req](const HeldRead& held) { return held.req == req; });
-    if (read != heldReads.end()) {
-        heldReads.erase(read);
+            std::find_if(heldReads_.begin(), heldReads_.end(), [req](const HeldRead& held) { return held.req == req; });
+    if (read != heldReads_.end()) {
+        heldReads_.erase(read);
         fuse_reply_err(req, EINTR);
         return;
     }
-    auto write = std::find_if(heldWrites.begin(), heldWrites.end(),
+    auto write = std::find_if(heldWrites_.begin(), heldWrites_.end(),
                               [req](const HeldWrite& held) { return held.req == req; });
-    if (write != heldWrites.end()) {
-        heldWrites.erase(write);
+    if (write != heldWrites_.end()) {
+        heldWrites_.erase(write);
         fuse_reply_err(req, EINTR);
     }
     // Not found: the request was answered already, or is not queued yet and its handler
@@ -94,29 +94,29 @@ void RecordNode::Interrupt(fuse_req_t req) {
 }
 
 void RecordNode::ReplyWithHead(fuse_req_t req, size_t size) {
-    const std::string& head = records.front();
-    size_t length = std::min(size, head.size() - headOffset);
-    fuse_reply_buf(req, head.data() + headOffset, length);
-    headOffset += length;
-    if (headOffset == head.size()) {
-        records.pop_front();
-        headOffset = 0;
+    const std::string& head = records_.front();
+    size_t length = std::min(size, head.size() - headOffset_);
+    fuse_reply_buf(req, head.data() + headOffset_, length);
+    headOffset_ += length;
+    if (headOffset_ == head.size()) {
+        records_.pop_front();
+        headOffset_ = 0;
     }
 }
 
 // Moves the queue forward as far as it goes: held writers fill free room, held readers take
-// records; then pollers learn about the new state.
+// records_; then pollers_ learn about the new state.
 void RecordNode::Settle() {
     for (;;) {
-        if (!heldReads.empty() && !records.empty()) {
-            HeldRead held = heldReads.front();
-            heldReads.pop_front();
+        if (!heldReads_.empty() && !records_.empty()) {
+            HeldRead held = heldReads_.front();
+            heldReads_.pop_front();
             ReplyWithHead(held.req, held.size);
-        } else if (!heldWrites.empty() && records.size() < capacity) {
-            HeldWrite held = std::move(heldWrites.front());
-            heldWrites.pop_front();
+        } else if (!heldWrites_.empty() && records_.size() < capacity_) {
+            HeldWrite held = std::move(heldWrites_.front());
+            heldWrites_.pop_front();
             size_t size = held.record.size();
-            records.push_back(std::move(held.record));
+            records_.push_back(std::move(held.record));
             fuse_reply_write(held.req, size);
         } else {
             break;
@@ -126,22 +126,22 @@ void RecordNode::Settle() {
 }
 
 void RecordNode::NotifyPollers() {
-    for (fuse_pollhandle* ph : pollers) {
+    for (fuse_pollhandle* ph : pollers_) {
         fuse_lowlevel_notify_poll(ph);
         fuse_pollhandle_destroy(ph);
     }
-    pollers.clear();
+    pollers_.clear();
 }
 
 unsigned RecordNode::ReadyEvents() const {
     unsigned events = 0;
-    if (!records.empty()) {
+    if (!records_.empty()) {
         events |= POLLIN | POLLRDNORM;
-        if (priority) {
+        if (priority_) {
             events |= POLLPRI;
         }
     }
-    if (records.size() < capacity) {
+    if (records_.size() < capacity_) {
         events |= POLLOUT | POLLWRNORM;
     }
     return events;

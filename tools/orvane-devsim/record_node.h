@@ -5,9 +5,10 @@
 #include <fuse_lowlevel.h>
 
 #include <deque>
-#include <mutex>
 #include <string>
 #include <vector>
+
+#include <utils/Mutex.h>
 
 // One emulated kernel character device: a queue of records with the semantics of a driver's
 // record buffer. Each write is one record; each read returns at most one record (a short read
@@ -17,12 +18,12 @@
 // priority node also as POLLPRI.
 //
 // Threads: every operation runs on one of the FUSE session's worker threads (or on the thread
-// that delivers an interrupt); all state is guarded by `lock`. Replies to held requests are sent
-// under `lock`, which libfuse allows because replying never takes a request's own lock.
+// that delivers an interrupt); all state is guarded by `lock_`. Replies to held requests are sent
+// under `lock_`, which libfuse allows because replying never takes a request's own lock.
 class RecordNode {
 public:
     RecordNode(const char* name, fuse_ino_t ino, bool priority, size_t capacity)
-        : name(name), ino(ino), priority(priority), capacity(capacity) {}
+        : name(name), ino(ino), priority_(priority), capacity_(capacity) {}
     RecordNode(const RecordNode&) = delete;
     RecordNode& operator=(const RecordNode&) = delete;
 
@@ -47,20 +48,19 @@ private:
 
     static void OnInterrupt(fuse_req_t req, void* node);
     void Interrupt(fuse_req_t req);
-    // The helpers below run with `lock` held.
-    void ReplyWithHead(fuse_req_t req, size_t size);
-    void Settle();
-    void NotifyPollers();
-    unsigned ReadyEvents() const;
+    void ReplyWithHead(fuse_req_t req, size_t size) REQUIRES(lock_);
+    void Settle() REQUIRES(lock_);
+    void NotifyPollers() REQUIRES(lock_);
+    unsigned ReadyEvents() const REQUIRES(lock_);
 
-    const bool priority;
-    const size_t capacity;
-    std::mutex lock;
-    std::deque<std::string> records;
-    size_t headOffset = 0;  // bytes of the head record already read
-    std::deque<HeldRead> heldReads;
-    std::deque<HeldWrite> heldWrites;
-    std::vector<fuse_pollhandle*> pollers;
+    const bool priority_;
+    const size_t capacity_;
+    android::Mutex lock_;
+    std::deque<std::string> records_ GUARDED_BY(lock_);
+    size_t headOffset_ GUARDED_BY(lock_) = 0;  // bytes of the head record already read
+    std::deque<HeldRead> heldReads_ GUARDED_BY(lock_);
+    std::deque<HeldWrite> heldWrites_ GUARDED_BY(lock_);
+    std::vector<fuse_pollhandle*> pollers_ GUARDED_BY(lock_);
 };
 
 #endif  // ORVANE_TOOLS_DEVSIM_RECORD_NODE_H

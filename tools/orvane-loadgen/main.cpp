@@ -1,5 +1,6 @@
 // orvane-loadgen: drives a running daemon through its kernel event device and measures what
-// it sustains end to end, from the write on the node to the commit in its event database.
+// it sustains end to end, from the write on the node to the commit in its event database, and
+// how much memory it takes under a flood.
 // Commits are observed, not queried: the database runs in rollback-journal mode, so each commit
 // deletes "event.db-journal" in the work folder, and inotify reports that without taking a lock
 // the daemon would have to wait for.
@@ -14,13 +15,17 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include <android-base/unique_fd.h>
+
 namespace {
 
+using android::base::unique_fd;
 using Clock = std::chrono::steady_clock;
 
 double Seconds(Clock::duration span) {
@@ -31,17 +36,12 @@ double Seconds(Clock::duration span) {
 class CommitWatch {
 public:
     bool Open(const std::string& workDir) {
-        fd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
-        return fd_ >= 0 && inotify_add_watch(fd_, workDir.c_str(), IN_DELETE) >= 0;
-    }
-    ~CommitWatch() {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
+        fd_.reset(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+        return fd_.ok() && inotify_add_watch(fd_.get(), workDir.c_str(), IN_DELETE) >= 0;
     }
     // Waits up to `timeoutMs` for commits; returns how many arrived (0 on time-out).
     int Wait(int timeoutMs) {
-        struct pollfd watch = {fd_, POLLIN, 0};
+        struct pollfd watch = {fd_.get(), POLLIN, 0};
         if (poll(&watch, 1, timeoutMs) <= 0) {
             return 0;
         }
@@ -52,7 +52,7 @@ public:
         alignas(inotify_event) char buffer[4096];
         int commits = 0;
         ssize_t length;
-        while ((length = read(fd_, buffer, sizeof(buffer))) > 0) {
+        while ((length = read(fd_.get(), buffer, sizeof(buffer))) > 0) {
             for (char* at = buffer; at < buffer + length;) {
                 auto* event = reinterpret_cast<inotify_event*>(at);
                 if (event->len > 0 && strcmp(event->name, "event.db-journal") == 0) {
@@ -69,12 +69,13 @@ public:
     Clock::time_point lastCommit;
 
 private:
-    int fd_ = -1;
+    unique_fd fd_;
 };
 
 struct ProcessUsage {
     double cpuSeconds = 0;
-    long peakRssKb = 0;
+    long peakRssKb = 0;  // VmHWM
+    long rssKb = 0;      // VmRSS
 };
 
 ProcessUsage ReadUsage(pid_t pid) {
@@ -91,9 +92,8 @@ ProcessUsage ReadUsage(pid_t pid) {
     if (FILE* status = fopen((proc + "/status").c_str(), "r")) {
         char line[256];
         while (fgets(line, sizeof(line), status) != nullptr) {
-            if (sscanf(line, "VmHWM: %ld kB", &usage.peakRssKb) == 1) {
-                break;
-            }
+            sscanf(line, "VmHWM: %ld kB", &usage.peakRssKb);
+            sscanf(line, "VmRSS: %ld kB", &usage.rssKb);
         }
         fclose(status);
     }
@@ -101,10 +101,9 @@ ProcessUsage ReadUsage(pid_t pid) {
 }
 
 bool WriteRecord(int fd, uint32_t id, const char* params) {
-    char record[256];
-    int length = snprintf(record, sizeof(record), "EventId %u -t %ld -paraList %s", id,
-                          static_cast<long>(time(nullptr)), params);
-    return write(fd, record, length) == length;
+    std::string record =
+            "EventId " + std::to_string(id) + " -t " + std::to_string(time(nullptr)) + " -paraList " + params;
+    return write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
 }
 
 // Writes records of `ids` distinct ids, round robin, as fast as the daemon stores them, for
@@ -226,10 +225,61 @@ int Latency(int node, CommitWatch& commits, double rate, double seconds) {
     return 0;
 }
 
+// Writes `records` records of about `bytes` bytes each from `writers` threads, each on its own
+// descriptor, as fast as the node takes them, then waits until the daemon has gone idle (no CPU
+// time for a second). Reports the daemon's resident memory before, its peak (VmHWM) and after.
+// The ids cycle through `ids` values so that storage keeps a realistic share.
+int Flood(const char* node, pid_t pid, uint32_t ids, uint64_t records, size_t bytes, int writers) {
+    constexpr uint32_t kFirstId = 905100000;
+    ProcessUsage before = ReadUsage(pid);
+    if (before.rssKb == 0) {
+        fprintf(stderr, "orvane-loadgen: no daemon with pid %d\n", pid);
+        return 1;
+    }
+    std::atomic<uint64_t> next{0};
+    std::atomic<bool> failed{false};
+    Clock::time_point start = Clock::now();
+    std::vector<std::thread> threads;
+    for (int w = 0; w < writers; ++w) {
+        threads.emplace_back([&] {
+            unique_fd fd(open(node, O_WRONLY | O_CLOEXEC));
+            if (!fd.ok()) {
+                fprintf(stderr, "orvane-loadgen: cannot open %s: %s\n", node, strerror(errno));
+                failed = true;
+                return;
+            }
+            std::string params = "{\"flood\":\"" + std::string(bytes > 64 ? bytes - 64 : 1, 'f') + "\"}";
+            for (uint64_t i; !failed && (i = next++) < records;) {
+                if (!WriteRecord(fd.get(), kFirstId + static_cast<uint32_t>(i % ids), params.c_str())) {
+                    fprintf(stderr, "orvane-loadgen: write failed: %s\n", strerror(errno));
+                    failed = true;
+                }
+            }
+        });
+    }
+    for (std::thread& thread : threads) {
+        thread.join();
+    }
+    double writeSeconds = Seconds(Clock::now() - start);
+    // Idle once a second passes without CPU time.
+    for (double cpu = -1; ReadUsage(pid).cpuSeconds != cpu;) {
+        cpu = ReadUsage(pid).cpuSeconds;
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+    }
+    double settleSeconds = Seconds(Clock::now() - start);
+    ProcessUsage after = ReadUsage(pid);
+    printf("records=%llu bytes_per_record=%zu writers=%d write_s=%.1f settled_s=%.1f rss_before_kb=%ld "
+           "peak_rss_kb=%ld rss_after_kb=%ld\n",
+           static_cast<unsigned long long>(std::min<uint64_t>(next, records)), bytes, writers, writeSeconds,
+           settleSeconds, before.rssKb, after.peakRssKb, after.rssKb);
+    return failed ? 1 : 0;
+}
+
 int Usage() {
     fprintf(stderr,
             "usage: orvane-loadgen throughput NODE WORKDIR DAEMON_PID IDS SECONDS\n"
             "       orvane-loadgen latency NODE WORKDIR RATE SECONDS\n"
+            "       orvane-loadgen flood NODE DAEMON_PID IDS RECORDS BYTES WRITERS\n"
             "NODE is the daemon's kernel event device (qxev), WORKDIR its work folder.\n");
     return 2;
 }
@@ -237,13 +287,18 @@ int Usage() {
 }  // namespace
 
 int main(int argc, char** argv) {
+    if (argc == 8 && strcmp(argv[1], "flood") == 0) {
+        return Flood(argv[2], atoi(argv[3]), static_cast<uint32_t>(std::max(1, atoi(argv[4]))),
+                     strtoull(argv[5], nullptr, 10), static_cast<size_t>(std::max(1, atoi(argv[6]))),
+                     std::max(1, atoi(argv[7])));
+    }
     bool throughput = argc == 7 && strcmp(argv[1], "throughput") == 0;
     bool latency = argc == 6 && strcmp(argv[1], "latency") == 0;
     if (!throughput && !latency) {
         return Usage();
     }
-    int node = open(argv[2], O_WRONLY | O_CLOEXEC);
-    if (node < 0) {
+    unique_fd node(open(argv[2], O_WRONLY | O_CLOEXEC));
+    if (!node.ok()) {
         fprintf(stderr, "orvane-loadgen: cannot open %s: %s\n", argv[2], strerror(errno));
         return 1;
     }
@@ -252,9 +307,7 @@ int main(int argc, char** argv) {
         fprintf(stderr, "orvane-loadgen: cannot watch %s: %s\n", argv[3], strerror(errno));
         return 1;
     }
-    int rc = throughput ? Throughput(node, commits, atoi(argv[4]), static_cast<uint32_t>(std::max(1, atoi(argv[5]))),
-                                     atof(argv[6]))
-                        : Latency(node, commits, atof(argv[4]), atof(argv[5]));
-    close(node);
-    return rc;
+    return throughput ? Throughput(node.get(), commits, atoi(argv[4]),
+                                   static_cast<uint32_t>(std::max(1, atoi(argv[5]))), atof(argv[6]))
+                      : Latency(node.get(), commits, atof(argv[4]), atof(argv[5]));
 }

@@ -1,0 +1,91 @@
+// The daemon as a process, fed through emulated device nodes, while another process reads its store.
+#include <signal.h>
+#include <spawn.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "tests/common/log_capture.h"
+#include "tests/plugins/devsim_process.h"
+#include "tests/storage/storage_test_util.h"
+#include "utils/time_util.h"
+
+extern char** environ;
+
+namespace android::Orvane {
+namespace {
+
+class StorageDaemonTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::string failure;
+        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || !devsim_.Start(&failure))
+            GTEST_SKIP() << "the daemon or the device emulator is unavailable: " << failure;
+        WriteFile(root_.File("properties"), "ro.quor.build.region=CN\n");
+    }
+    void TearDown() override { StopDaemon(); }
+
+    // The shipped configuration on the emulated kernel event node; the daemon's log goes to orvane.log.
+    void StartDaemon() {
+        std::string command = "ORVANE_PROPERTY_FILE=" + root_.File("properties") + " exec setpriv --pdeathsig KILL " +
+                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " +
+                              root_.File("work") + " -cloudCfgDir " + root_.File("cloud") +
+                              " -devList qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + root_.File("no_node") +
+                              " >>" + root_.File("orvane.log") + " 2>&1";
+        const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
+        ASSERT_EQ(posix_spawn(&daemon_, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
+    }
+    void StopDaemon() {
+        if (daemon_ > 0 && kill(daemon_, SIGTERM) == 0)
+            waitpid(daemon_, nullptr, 0);
+        daemon_ = -1;
+    }
+    void Record(uint32_t id, uint64_t happenTime, const std::string& params) {
+        ASSERT_TRUE(devsim_.Inject("qxev", "EventId " + std::to_string(id) + " -t " + std::to_string(happenTime) +
+                                                   " -paraList " + params));
+    }
+    // Waits until the daemon has stored `count` events that match `where`.
+    bool WaitStored(const std::string& where, int count) {
+        const std::string sql = "select count(*) from event_info where " + where;
+        return WaitUntil(
+                [&] {
+                    return access(db_.c_str(), F_OK) == 0 &&
+                           Column(db_, "select count(*) from sqlite_master where name = 'event_info'") == Texts{"1"} &&
+                           Column(db_, sql) == Texts{std::to_string(count)};
+                },
+                std::chrono::seconds(30));
+    }
+    std::string Log() { return ReadFile(root_.File("orvane.log")); }
+
+    DevSim devsim_;
+    TempDir root_;
+    std::string db_ = root_.File("work/event.db");
+    pid_t daemon_ = -1;
+};
+
+// Another process reading event.db for a while (a shell, a backup) delays the daemon's writes but
+// costs no event.
+TEST_F(StorageDaemonTest, ReaderHoldingATransactionCostsNoEvent) {
+    uint64_t now = TimeUtil::GetTimestampSecond();
+    StartDaemon();
+    Record(903000001, now, "{\"warm\":1}");
+    ASSERT_TRUE(WaitStored("event_id = 903000001", 1)) << Log();
+    sqlite3* reader = nullptr;
+    ASSERT_EQ(sqlite3_open(db_.c_str(), &reader), SQLITE_OK);
+    sqlite3_busy_timeout(reader, 20000);
+    ASSERT_EQ(sqlite3_exec(reader, "BEGIN; select count(*) from event_info;", nullptr, nullptr, nullptr), SQLITE_OK);
+    for (uint32_t i = 0; i < 20; i++)
+        Record(903001000 + i, now, "{\"during\":" + std::to_string(i) + "}");
+    // The read transaction stays open this long while the records arrive.
+    std::this_thread::sleep_for(std::chrono::seconds(2));
+    sqlite3_exec(reader, "COMMIT", nullptr, nullptr, nullptr);
+    sqlite3_close(reader);
+    EXPECT_TRUE(WaitStored("event_id between 903001000 and 903001019", 20)) << Log();
+}
+
+}  // namespace
+}  // namespace android::Orvane
