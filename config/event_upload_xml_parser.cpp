@@ -52,10 +52,10 @@ bool IsPlainFileName(const std::string& name) {
 
 // Words separated by single blanks, as the command runner splits them (no shell, no quoting).
 bool IsCommandLine(const std::string& command) {
-    return !command.empty() && command.size() <= kMaxCommandLength && command.front() != ' ' &&
-           command.back() != ' ' && command.find("  ") == std::string::npos &&
-           std::none_of(command.begin(), command.end(),
-                        [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; });
+    return !command.empty() && command.size() <= kMaxCommandLength && command.front() != ' ' && command.back() != ' ' &&
+           command.find("  ") == std::string::npos && std::none_of(command.begin(), command.end(), [](char c) {
+               return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
+           });
 }
 
 // Reads one document in element mode into new rules. Lives for one reading only.
@@ -75,7 +75,7 @@ public:
             error = "not well-formed XML";
         } else if (!rootError_.empty()) {
             error = rootError_;
-        } else if (!IsStart()) {
+        } else if (!sawRoot_) {
             error = std::string("no ") + kRootElement + " element";
         }
         if (!error.empty()) {
@@ -85,9 +85,10 @@ public:
         return rules_;
     }
 
-    bool IsMatch(const std::string& name) override {
+    bool IsMatch(const std::string& name) override REQUIRES(gXmlDocumentMutex) {
         if (name == kRootElement) {
             SetStart();
+            sawRoot_ = true;
             return true;
         }
         rootError_ = "root element " + name + " is not " + kRootElement;
@@ -95,7 +96,8 @@ public:
         return false;
     }
 
-    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override {
+    void OnStartElement(const std::string& name, const std::map<std::string, std::string>& attributes) override
+            REQUIRES(gXmlDocumentMutex) {
         if (name == kRuleSetElement) {
             OpenRuleSet(attributes);
         } else if (name == "Static" || name == "Dynamic" || name == "Command") {
@@ -104,7 +106,7 @@ public:
         // The root and other elements are left to newer readers.
     }
 
-    void OnEndElement(const std::string& name) override {
+    void OnEndElement(const std::string& name) override REQUIRES(gXmlDocumentMutex) {
         if (name == kRuleSetElement && depth_ > 0 && --depth_ == 0) {
             current_ = nullptr;
             skipping_ = false;
@@ -128,12 +130,12 @@ private:
         UploadRules::RuleSet ruleSet;
         std::string id = GetAttribute(attributes, "eventId");
         bool ranged = attributes.count("eventMin") != 0 || attributes.count("eventMax") != 0;
-        bool valid = id.empty() ? ranged && ParseNumber(GetAttribute(attributes, "eventMin"), UINT32_MAX,
-                                                        ruleSet.eventMin) &&
-                                          ParseNumber(GetAttribute(attributes, "eventMax"), UINT32_MAX,
-                                                      ruleSet.eventMax) &&
-                                          ruleSet.eventMin <= ruleSet.eventMax
-                                : !ranged && ParseNumber(id, UINT32_MAX, ruleSet.eventMin);
+        bool valid =
+                id.empty()
+                        ? ranged && ParseNumber(GetAttribute(attributes, "eventMin"), UINT32_MAX, ruleSet.eventMin) &&
+                                  ParseNumber(GetAttribute(attributes, "eventMax"), UINT32_MAX, ruleSet.eventMax) &&
+                                  ruleSet.eventMin <= ruleSet.eventMax
+                        : !ranged && ParseNumber(id, UINT32_MAX, ruleSet.eventMin);
         if (!id.empty()) {
             ruleSet.eventMax = ruleSet.eventMin;
         }
@@ -237,6 +239,7 @@ private:
     const std::string path_;
     std::shared_ptr<UploadRules> rules_;
     std::string rootError_;
+    bool sawRoot_ = false;
     UploadRules::RuleSet* current_ = nullptr;  // the open rule set, into rules_->ruleSets
     int depth_ = 0;                            // LogRule elements open
     bool skipping_ = false;                    // the open rule set was rejected
@@ -278,6 +281,9 @@ std::shared_ptr<const UploadRules> EventUploadXmlParser::ReadRules(const std::st
     std::shared_ptr<const UploadRules> rules = reader->Read(error);
     if (rules == nullptr) {
         OLOGE("%s log rules %s refused (%s): no logs are collected", path.c_str(), error.c_str());
+        if (stats != nullptr) {
+            stats->Add(std::string("config.read_failed.") + kFileName);
+        }
         auto none = std::make_shared<UploadRules>();
         none->source = path;
         return none;
@@ -300,7 +306,7 @@ std::shared_ptr<const UploadRules> EventUploadXmlParser::GetRules(const std::str
     }
     checkedAt_ = now;
     checkedFolders_ = folders;
-    DocumentChoice choice = ConfigDocument::Choose(cloudDir, configDir, kFileName, stats);
+    DocumentChoice choice = ConfigDocument::Choose(DocumentFolders(cloudDir, configDir, stats), kFileName);
     if (current_ != nullptr && choice.path == loadedPath_ && choice.stamp == loadedStamp_) {
         return current_;
     }

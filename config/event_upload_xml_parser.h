@@ -38,14 +38,14 @@ struct LogCollectInfo {
     };
 
     Kind kind = Kind::kStatic;
-    std::string path;                             // kStatic: the file; kDynamic: the folder
-    std::shared_ptr<const FilePattern> pattern;   // kDynamic: file names, whole-name match
-    uint32_t count = 1;                           // kDynamic: how many of the newest matches
-    uint32_t maxAgeSec = 0;                       // kDynamic: oldest modification age taken; 0 any
-    std::string command;                          // kCommand: words separated by single blanks
-    uint32_t timeoutSec = kDefaultTimeoutSec;     // kCommand
-    std::string fileName;                         // kCommand: the output's name inside the pack
-    bool deleteLog = false;                       // kStatic, kDynamic: delete the files once packed
+    std::string path;                            // kStatic: the file; kDynamic: the folder
+    std::shared_ptr<const FilePattern> pattern;  // kDynamic: file names, whole-name match
+    uint32_t count = 1;                          // kDynamic: how many of the newest matches
+    uint32_t maxAgeSec = 0;                      // kDynamic: oldest modification age taken; 0 any
+    std::string command;                         // kCommand: words separated by single blanks
+    uint32_t timeoutSec = kDefaultTimeoutSec;    // kCommand
+    std::string fileName;                        // kCommand: the output's name inside the pack
+    bool deleteLog = false;                      // kStatic, kDynamic: delete the files once packed
     std::vector<CollectedFile> collected;
 
     bool IsDeleteLog() const { return deleteLog && kind != Kind::kCommand; }

@@ -226,7 +226,6 @@ void EventLogProcessor::OnLoad() {
         return;
     }
     workDir_ = context_->GetWorkDir();
-    configDir_ = context_->GetConfigDir();
     osVersion_ = DevInfo::GetQuorVersion();
     counters_ = std::make_unique<Counters>(context_->GetStats());
     pathCheck_ = std::make_unique<PrivacyPathCheck>(*context_);
@@ -379,7 +378,7 @@ void EventLogProcessor::CheckAndClearLogFolder(sp<Event> event) {
     std::string dir = workDir_ + domain;
     EventQuotaXmlParser::DomainQuota limitInfo;
     sp<EventQuotaXmlParser> quota = EventQuotaXmlParser::getInstance();
-    if (!quota->CheckLogCntLimitAfterIncr(configDir_, osVersion_, id, 0, &limitInfo)) {
+    if (!quota->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, 0, &limitInfo)) {
         return;
     }
     std::vector<std::string> packs;
@@ -403,7 +402,7 @@ void EventLogProcessor::CheckAndClearLogFolder(sp<Event> event) {
     if (deleted > 0) {
         counters_->folderTrimmed.fetch_add(static_cast<uint64_t>(deleted), std::memory_order_relaxed);
         OLOGI("%s domain %s full, %d packs deleted, %d kept", domain.c_str(), deleted, keep);
-        quota->CheckLogCntLimitAfterIncr(configDir_, osVersion_, id, -deleted);
+        quota->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, -deleted);
     }
 }
 
@@ -416,7 +415,7 @@ void EventLogProcessor::InitRecordLogCnt() {
         for (const std::string& pack : packs) {
             uint32_t id = PackId(pack);
             if (id != 0) {
-                quota->CheckLogCntLimitAfterIncr(configDir_, osVersion_, id, 1);
+                quota->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, 1);
                 restored++;
             }
         }
@@ -458,7 +457,7 @@ void EventLogProcessor::ProcessEventLog(sp<Event> event) {
     }
     DeleteTempFileInEventDir(tempFiles);
     if (ok) {
-        EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(configDir_, osVersion_, id, 1);
+        EventQuotaXmlParser::getInstance()->CheckLogCntLimitAfterIncr(*context_, osVersion_, id, 1);
     }
     OLOGD("%s ProcessEventLog ProcessEventLog eventid over %d", static_cast<int>(id));
 }
@@ -528,8 +527,7 @@ void EventLogProcessor::AddCmdLog(const std::string& eventDir, LogCollectInfo& r
     std::string path = eventDir + "/" + kTempPrefix + rule.fileName + ".XXXXXX";
     android::base::unique_fd fd(mkostemp(path.data(), O_CLOEXEC));
     if (fd < 0) {
-        OLOGE("%s cannot create the output of '%s' in %s: %s", rule.command.c_str(), eventDir.c_str(),
-              strerror(errno));
+        OLOGE("%s cannot create the output of '%s' in %s: %s", rule.command.c_str(), eventDir.c_str(), strerror(errno));
         return;
     }
     tempFiles.push_back(path);
@@ -564,7 +562,7 @@ bool EventLogProcessor::PackLogToZip(sp<Event> event, std::vector<LogSource>& fi
         counters_->packFailed.fetch_add(1, std::memory_order_relaxed);
         return false;
     }
-    uint32_t spaceKiB = EventQuotaXmlParser::getInstance()->GetEventQuota(configDir_, osVersion_, id).logSpace;
+    uint32_t spaceKiB = EventQuotaXmlParser::getInstance()->GetEventQuota(*context_, osVersion_, id).logSpace;
     uint64_t budget = static_cast<uint64_t>(spaceKiB) * 1024;
     uint64_t entries = 0;
     for (LogSource& source : files) {
@@ -599,8 +597,8 @@ bool EventLogProcessor::PackLogToZip(sp<Event> event, std::vector<LogSource>& fi
         off_t before = lseek(fd.get(), 0, SEEK_CUR);
         pack.AddFileFromFd(fd.get(), entry, grant);
         off_t after = lseek(fd.get(), 0, SEEK_CUR);
-        budget -= std::min<uint64_t>(budget, before >= 0 && after > before ? static_cast<uint64_t>(after - before)
-                                                                           : grant);
+        budget -= std::min<uint64_t>(budget,
+                                     before >= 0 && after > before ? static_cast<uint64_t>(after - before) : grant);
         source.leftOut = false;
         entries++;
     }
@@ -641,7 +639,7 @@ bool EventLogProcessor::CanUpload() {
 
 bool EventLogProcessor::IsNotExpired() {
     EventQuotaXmlParser::SummaryQuota summary =
-            EventQuotaXmlParser::getInstance()->GetSummaryQuota(configDir_, osVersion_);
+            EventQuotaXmlParser::getInstance()->GetSummaryQuota(*context_, osVersion_);
     uint64_t activated = DevInfo::GetActivateTime();
     uint64_t now = TimeUtil::GetTimestampSecond();
     auto months = [](uint32_t count) { return static_cast<uint64_t>(count) * kMonthSeconds; };
@@ -734,7 +732,7 @@ int EventLogProcessor::ProcessUploadingLog() {
         std::string uploading = dir + "/" + kUploading;
         FileUtil::CreateDirectory(uploading, kFolderMode);
         for (const std::string& pack : packs) {
-            quota->CheckLogCntLimitAfterIncr(configDir_, osVersion_, PackId(pack), -1);
+            quota->CheckLogCntLimitAfterIncr(*context_, osVersion_, PackId(pack), -1);
             std::string target = uploading + "/" + BaseName(pack);
             if (FileUtil::MoveFile(pack, target)) {
                 FileUtil::ChangeMode(target, kPackMode);
@@ -817,8 +815,7 @@ std::vector<std::string> EventLogProcessor::GetFileInDirByPattern(const std::str
     return paths;
 }
 
-void EventLogProcessor::GetLogFiles(const std::string& dir, const std::string& domain,
-                                    std::vector<std::string>& out) {
+void EventLogProcessor::GetLogFiles(const std::string& dir, const std::string& domain, std::vector<std::string>& out) {
     std::string pattern = DomainPackPattern(domain);
     for (const std::string& folder : {dir, dir + "/" + kUeOff}) {
         std::vector<std::string> packs = GetFileInDirByPattern(folder, pattern, -1);
@@ -839,10 +836,9 @@ void EventLogProcessor::Dump(int fd, const std::vector<std::string>& args) {
             rules->source.empty() ? "none" : rules->source.c_str(), rules->ruleSets.size(), rules->rejected);
     dprintf(fd, "collections waiting for a worker: %zu of at most %zu\n", waiting_.load(), kMaxWaitingCollections);
     DaemonStats& stats = context_->GetStats();
-    for (const char* name : {"logproc.pack.made", "logproc.pack.failed", "logproc.queue.overflow",
-                             "logproc.space.cut", "logproc.space.left_out", "logproc.source.missing",
-                             "logproc.folder.trimmed", "logproc.handover.packs", "logproc.handover.eventinfo",
-                             "privacy.path.refused"}) {
+    for (const char* name : {"logproc.pack.made", "logproc.pack.failed", "logproc.queue.overflow", "logproc.space.cut",
+                             "logproc.space.left_out", "logproc.source.missing", "logproc.folder.trimmed",
+                             "logproc.handover.packs", "logproc.handover.eventinfo", "privacy.path.refused"}) {
         dprintf(fd, "%s %" PRIu64 "\n", name, stats.Value(name));
     }
 }

@@ -133,7 +133,6 @@ private:
 
     PluginContext* context_ = nullptr;
     std::string workDir_;
-    std::string configDir_;
     std::string osVersion_;
     std::unique_ptr<Counters> counters_;
     std::unique_ptr<PrivacyPathCheck> pathCheck_;
