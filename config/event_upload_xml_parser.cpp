@@ -123,7 +123,7 @@ private:
     void OpenRuleSet(const std::map<std::string, std::string>& attributes) {
         if (depth_++ > 0) {
             if (!skipping_) {
-                Reject(kRuleSetElement, "a LogRule inside a LogRule (the outer one is kept)");
+                Reject(kRuleSetElement, "a LogRule inside a LogRule (it is left out with its sources)");
             }
             return;
         }
@@ -150,7 +150,7 @@ private:
     }
 
     void AddLog(const std::string& element, const std::map<std::string, std::string>& attributes) {
-        if (skipping_) {
+        if (skipping_ || depth_ > 1) {
             return;  // left out with its rule set
         }
         if (current_ == nullptr) {

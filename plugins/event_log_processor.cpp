@@ -597,8 +597,9 @@ bool EventLogProcessor::PackLogToZip(sp<Event> event, std::vector<LogSource>& fi
         off_t before = lseek(fd.get(), 0, SEEK_CUR);
         pack.AddFileFromFd(fd.get(), entry, grant);
         off_t after = lseek(fd.get(), 0, SEEK_CUR);
+        // What was read counts, not what was granted: an empty file costs nothing.
         budget -= std::min<uint64_t>(budget,
-                                     before >= 0 && after > before ? static_cast<uint64_t>(after - before) : grant);
+                                     before >= 0 && after >= before ? static_cast<uint64_t>(after - before) : grant);
         source.leftOut = false;
         entries++;
     }
