@@ -311,6 +311,7 @@ bool EventLogProcessor::CheckIfNeedProcessLog(sp<Event> event) {
     if (!noCatchLog.empty()) {
         if (noCatchLog != kNoLogConfig) {
             event->SetValue(kKeyZipLogName, noCatchLog);
+            OLOGI_LIMITED("%s event %u: no logs caught, %s", event->eventId, noCatchLog.c_str());
         }
         return false;
     }
