@@ -227,6 +227,28 @@ TEST_F(EventLogProcessorTest, PackHoldsTheAllowedRuleSources) {
     EXPECT_EQ(Read(root_ + "/private/secret.txt"), "secret");
 }
 
+// A folder of 1,000 matching files gives exactly the newest `count`, whatever the order of the
+// names; files that do not match the whole pattern are never taken.
+TEST_F(EventLogProcessorTest, NewestOfAThousandMatches) {
+    time_t now = time(nullptr);
+    for (int i = 0; i < 1000; i++) {
+        std::string name = "/logs/dyn/log_" + std::to_string((i * 7919) % 1000) + ".txt";
+        Write(name, std::to_string(i));
+        struct timespec times[2] = {{now - 2000 + i, 0}, {now - 2000 + i, 0}};
+        ASSERT_EQ(utimensat(AT_FDCWD, (root_ + name).c_str(), times, 0), 0);
+    }
+    Write("/logs/dyn/log_1.txt.old", "not matched");
+    Rules("<LogRule eventId=\"901003001\"><Dynamic dir=\"" + root_ +
+          "/logs/dyn\" pattern=\"log_\\d+\\.txt\" count=\"3\"/></LogRule>");
+    Load();
+    EXPECT_EQ(Deliver(Fault(901003001)), 0);
+    ASSERT_TRUE(WaitPacks("901", 1));
+    std::string dyn = root_.substr(1) + "/logs/dyn/log_";
+    EXPECT_EQ(ReadZip(Packs("901").at(0)), (Entries{{dyn + std::to_string((997 * 7919) % 1000) + ".txt", "997"},
+                                                    {dyn + std::to_string((998 * 7919) % 1000) + ".txt", "998"},
+                                                    {dyn + std::to_string((999 * 7919) % 1000) + ".txt", "999"}}));
+}
+
 // logSpace caps a pack's uncompressed sources: a larger file gives its newest part, a file after
 // the cap is left out, each with a warning and a count. With the switch off the pack lies in
 // "ue_off" and no upload path is announced.
