@@ -105,9 +105,25 @@ std::unique_ptr<FilePattern> FilePattern::Compile(const std::string& expression,
         return refuse("an expression needs 1 to " + std::to_string(kMaxLength) + " characters");
     }
     std::string translated = "^(";
+    // The regex compiler copies the operand of "+" and of "{m,n}" (a+ is aa*), so the compiled
+    // form grows with the product of the counts, a "+" counting twice; an operator right after
+    // another is refused outright.
     unsigned long cost = 1;
+    bool afterRepetition = false;
+    auto addCost = [&cost](unsigned long factor) {
+        cost *= factor;
+        return cost <= kMaxRepetition;
+    };
     for (size_t i = 0; i < expression.size(); ++i) {
         char c = expression[i];
+        bool repetition = c == '*' || c == '+' || c == '?' || c == '{';
+        if (repetition && afterRepetition) {
+            return refuse("a repetition cannot follow another repetition");
+        }
+        afterRepetition = repetition;
+        if (c == '+' && !addCost(2)) {
+            return refuse("repetitions multiply to more than " + std::to_string(kMaxRepetition));
+        }
         if (c == '\\') {
             if (++i == expression.size()) {
                 return refuse("the expression ends in a backslash");
@@ -128,9 +144,8 @@ std::unique_ptr<FilePattern> FilePattern::Compile(const std::string& expression,
             if (bound < 0) {
                 return refuse("a repetition must read {m}, {m,} or {m,n}");
             }
-            cost *= static_cast<unsigned long>(bound > 1 ? bound : 1);
-            if (cost > kMaxRepetition) {
-                return refuse("repetition counts multiply to more than " + std::to_string(kMaxRepetition));
+            if (!addCost(static_cast<unsigned long>(bound > 1 ? bound : 1))) {
+                return refuse("repetitions multiply to more than " + std::to_string(kMaxRepetition));
             }
             translated.append(expression, start, i + 1 - start);
         } else {

@@ -14,8 +14,9 @@ namespace Orvane {
 // patterns ("EventId_\S+_\d{14}_\d{9}.zip") and the patterns of the log rules read alike.
 //
 // Expressions come from documents pushed from the cloud, so compiling never aborts and never
-// costs without bound: an expression longer than kMaxLength, with a back-reference, or whose
-// repetition counts ({m,n}) multiply to more than kMaxRepetition is refused, with the reason.
+// costs without bound: an expression longer than kMaxLength, with a back-reference, with a
+// repetition right after another ("a+*"), or whose repetition counts ({m,n}, and 2 for each "+")
+// multiply to more than kMaxRepetition is refused, with the reason.
 //
 // Threads: immutable once compiled; any thread may match.
 class FilePattern {
