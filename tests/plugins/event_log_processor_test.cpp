@@ -218,11 +218,14 @@ TEST_F(EventLogProcessorTest, PackHoldsTheAllowedRuleSources) {
         ASSERT_EQ(stat(pack.c_str(), &st), 0);
         EXPECT_EQ(st.st_mode & 0777, 0775u);
     }
-    // The three files packed are gone once the collection ends, the rest of the folder not.
-    EXPECT_TRUE(WaitUntil([&] { return !FileUtil::FileExists(logs + "dyn/trace_5.txt"); }));
+    // Once the collection ends the three files packed and the command's output are gone, the
+    // rest of the folder not.
+    EXPECT_TRUE(WaitUntil([&] {
+        return !FileUtil::FileExists(logs + "dyn/trace_5.txt") &&
+               EventLogProcessor::GetFileInDirByPattern(root_ + "/work/901", "\\..*", -1).empty();
+    }));
     EXPECT_EQ(EventLogProcessor::GetFileInDirByPattern(logs + "dyn", ".*", -1),
               (std::vector<std::string>{logs + "dyn/trace_1.txt", logs + "dyn/trace_2.txt", logs + "dyn/other.txt"}));
-    EXPECT_EQ(EventLogProcessor::GetFileInDirByPattern(root_ + "/work/901", "\\..*", -1).size(), 0u);
     EXPECT_EQ(Stat("privacy.path.refused"), 2u);
     EXPECT_EQ(Read(root_ + "/private/secret.txt"), "secret");
 }
