@@ -19,6 +19,7 @@
 #include "storage/event_database_helper.h"
 #include "tests/common/fake_plugin_context.h"
 #include "utils/file_util.h"
+#include "utils/sys_env.h"
 #include "utils/zip_pack.h"
 
 extern char** environ;
@@ -169,6 +170,7 @@ public:
         FileUtil::SaveStringToFile(
                 etc_ + "event_quota.xml",
                 "<EventQuota><unknown>" + section + "</unknown><bench>" + section + "</bench></EventQuota>", true);
+        SysEnv::SetSysProperity("persist.sys.orvane.upload_switch", "1");  // packs go to <domain>/
         processor_ = static_cast<EventLogProcessor*>(PluginFactory::CreatePlugin("EventLogProcessor").get());
         processor_->SetPluginContext(&context_);
         processor_->OnLoad();
