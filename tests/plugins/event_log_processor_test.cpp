@@ -1,10 +1,12 @@
 #include "plugins/event_log_processor.h"
 
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unzip.h>
 
 #include <future>
+#include <random>
 
 #include <android-base/file.h>
 #include <gtest/gtest.h>
@@ -397,6 +399,34 @@ TEST_F(EventLogProcessorTest, HandOverMovesPacksAndEventInfo) {
     struct stat st;
     ASSERT_EQ(stat((work + "uploading/eventinfo.906").c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0775u);
+}
+
+// A disk that fills while a pack is written (here: a file size limit of the process) leaves no
+// pack and no half-written file behind; the failure is counted and the next pack is made.
+TEST_F(EventLogProcessorTest, FullDiskLeavesNoHalfWrittenPack) {
+    std::mt19937 random(7);
+    std::string noise(512 << 10, '\0');
+    for (char& c : noise) {
+        c = static_cast<char>(random());
+    }
+    Write("/logs/noise.bin", noise);
+    Rules("<LogRule eventId=\"901004001\"><Static path=\"" + root_ + "/logs/noise.bin\"/></LogRule>");
+    Load();
+    struct rlimit unlimited;
+    ASSERT_EQ(getrlimit(RLIMIT_FSIZE, &unlimited), 0);
+    struct rlimit small = unlimited;
+    small.rlim_cur = 128 * 1024;
+    signal(SIGXFSZ, SIG_IGN);
+    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &small), 0);
+    EXPECT_EQ(Deliver(Fault(901004001)), 0);
+    bool failed = WaitUntil([&] { return Stat("logproc.pack.failed") == 1; }, std::chrono::seconds(30));
+    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &unlimited), 0);
+    ASSERT_TRUE(failed);
+    EXPECT_TRUE(
+            WaitUntil([&] { return EventLogProcessor::GetFileInDirByPattern(root_ + "/work/901", ".*", -1).empty(); }));
+    EXPECT_EQ(Deliver(Fault(901004001)), 0);
+    ASSERT_TRUE(WaitPacks("901", 1));
+    EXPECT_TRUE(ReadZip(Packs("901").at(0)).begin()->second == noise);
 }
 
 // A command that overruns its time-out is killed and the pack is made from what exists.
