@@ -3,14 +3,23 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdio>
 #include <random>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <benchmark/benchmark.h>
 
+#include "config/event_quota_xml_parser.h"
+#include "platform/plugin_factory.h"
+#include "plugins/event_log_processor.h"
+#include "storage/event_database.h"
+#include "storage/event_database_helper.h"
+#include "tests/common/fake_plugin_context.h"
 #include "utils/file_util.h"
+#include "utils/sys_env.h"
 #include "utils/zip_pack.h"
 
 extern char** environ;
@@ -65,6 +74,7 @@ public:
     const std::vector<std::string>& Paths() const { return paths_; }
     int64_t Bytes() const { return bytes_; }
     std::string Output(const char* name) const { return dir_ + "/" + name; }
+    const std::string& Dir() const { return dir_; }
 
 private:
     void Add(const std::string& name, const std::string& content) {
@@ -132,6 +142,120 @@ void BM_InfoZip(benchmark::State& state) {
     state.counters["zip_bytes"] = static_cast<double>(FileUtil::GetFileSize(output));
 }
 BENCHMARK(BM_InfoZip)->Unit(benchmark::kMillisecond)->Iterations(5)->UseRealTime();
+
+// The log processor with rules that take all the files above, a policy that allows them and a
+// quota whose log space holds them: a whole collection as a fault event gets it.
+class Collector {
+public:
+    static constexpr uint32_t kEventId = 901000001;
+
+    explicit Collector(const LogFiles& files) : etc_(files.Dir() + "/etc/"), work_(files.Dir() + "/work/") {
+        FileUtil::CreateDirectory(etc_, 0775);
+        FileUtil::CreateDirectory(work_, 0775);
+        std::string logs = files.Dir() + "/logs/";
+        FileUtil::SaveStringToFile(etc_ + "event_upload.xml",
+                                   "<EventUpload><LogRule eventId=\"" + std::to_string(kEventId) +
+                                           "\"><Dynamic dir=\"" + logs +
+                                           "\" pattern=\"main_\\d+\\.log\" count=\"20\"/><Dynamic dir=\"" + logs +
+                                           "\" pattern=\"small_\\d+\\.txt\" count=\"200\"/></LogRule></EventUpload>",
+                                   true);
+        FileUtil::SaveStringToFile(etc_ + "privacy_policy.xml",
+                                   "<PrivacyPolicy><Levels switchOn=\"1\" switchOff=\"1\"/><LogPaths><Allow prefix=\"" +
+                                           files.Dir() + "/\"/></LogPaths></PrivacyPolicy>",
+                                   true);
+        // Both sections: the processor's version is the device's ("unknown"), storage's "bench".
+        std::string section =
+                "<Summary defDailyCnt=\"2000000000\"/><Domain name=\"k\" eventMin=\"901000000\" "
+                "eventMax=\"901999999\" dailyCnt=\"2000000000\" maxLogCnt=\"8\" logSpace=\"40000\"/>";
+        FileUtil::SaveStringToFile(
+                etc_ + "event_quota.xml",
+                "<EventQuota><unknown>" + section + "</unknown><bench>" + section + "</bench></EventQuota>", true);
+        SysEnv::SetSysProperity("persist.sys.orvane.upload_switch", "1");  // packs go to <domain>/
+        processor_ = static_cast<EventLogProcessor*>(PluginFactory::CreatePlugin("EventLogProcessor").get());
+        processor_->SetPluginContext(&context_);
+        processor_->OnLoad();
+    }
+
+    // A fault event as storage hands it on; OnEvent names its pack and queues its collection.
+    sp<Event> Fault() {
+        sp<Event> event = new Event("bench");
+        event->eventType = 2;
+        event->eventId = kEventId;
+        event->happenTime = time(nullptr);
+        return event;
+    }
+    uint64_t Made() { return context_.GetStats().Value("logproc.pack.made"); }
+    std::string Etc() const { return etc_; }
+
+    std::string etc_, work_;
+    FakePluginContext context_{work_, etc_};
+    sp<EventLogProcessor> processor_;
+};
+
+// A whole collection on the calling thread: rules, listings, privacy checks, packing under the
+// space cap, the temporary name and the rename; compare with BM_InfoZip of the same run.
+void BM_CollectAndPack(benchmark::State& state) {
+    const LogFiles& files = GetLogFiles();
+    Collector collector(files);
+    for (auto _ : state) {
+        sp<Event> event = collector.Fault();
+        event->SetValue("EVENT_LOG_ZIP_NAME", "EventId_bench_sn_20260101000000_901000001.zip");
+        collector.processor_->ProcessEventLog(event);
+        state.PauseTiming();
+        std::string pack = collector.work_ + "901/EventId_bench_sn_20260101000000_901000001.zip";
+        state.counters["zip_bytes"] = static_cast<double>(FileUtil::GetFileSize(pack));
+        FileUtil::DeleteFile(pack);
+        state.ResumeTiming();
+    }
+    if (collector.Made() != static_cast<uint64_t>(state.iterations())) {
+        state.SkipWithError("a collection made no pack");
+    }
+    state.SetBytesProcessed(state.iterations() * files.Bytes());
+}
+BENCHMARK(BM_CollectAndPack)->Unit(benchmark::kMillisecond)->Iterations(5)->UseRealTime();
+
+// The pipeline's own work (storage's bookkeeping of fault events, on the calling thread) while
+// state.range(0) collections of the files above are being packed at all times on the workers.
+void BM_StoreWhilePacking(benchmark::State& state) {
+    const LogFiles& files = GetLogFiles();
+    Collector collector(files);
+    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
+    helper->Init(&collector.context_, "event.db", "bench");
+    const uint64_t inFlight = static_cast<uint64_t>(state.range(0));
+    std::atomic<bool> running{true};
+    std::thread feeder([&] {
+        uint64_t queued = 0;
+        while (running.load()) {
+            if (queued - collector.Made() < inFlight) {
+                sp<Event> event = collector.Fault();
+                collector.processor_->OnEvent(event);
+                queued++;
+            } else {
+                usleep(1000);
+            }
+        }
+    });
+    while (inFlight > 0 && collector.Made() == 0) {
+        usleep(1000);  // packing is under way before the measurement starts
+    }
+    uint64_t madeBefore = collector.Made();
+    int64_t n = 0;
+    uint64_t day = helper->GetDbStartTime();
+    for (auto _ : state) {
+        sp<Event> event = new Event("bench");
+        event->eventType = 2;
+        event->eventId = Collector::kEventId;
+        event->happenTime = day + 100;
+        event->SetValue("param_list", "{\"n\":" + std::to_string(n++) + "}");
+        helper->ProcessFaultEvent(event);
+    }
+    state.counters["packs_made"] = static_cast<double>(collector.Made() - madeBefore);
+    running = false;
+    feeder.join();
+    EventDatabase::getInstance()->Close();
+    state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_StoreWhilePacking)->Arg(0)->Arg(4)->Unit(benchmark::kMicrosecond)->MinTime(5)->UseRealTime();
 
 }  // namespace
 }  // namespace Orvane

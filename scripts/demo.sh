@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
 # The daemon's main job on a host, end to end: kernel records written to emulated device
 # nodes become events that the privacy policy filters and that are counted, paced and stored in
-# event.db under the shipped quotas. Starts orvane-devsim and the daemon in a sandbox folder,
-# writes a stream of records, shows what was stored and what was dropped and why, makes CPU
+# event.db under the shipped quotas, and whose logs are packed into zip packs for upload. Starts
+# orvane-devsim and the daemon in a sandbox folder, writes a stream of records, shows what was
+# stored and what was dropped and why, which log packs were made and handed over, makes CPU
 # pressure that the kernel's pressure stall trigger turns into a performance event (where
 # triggers can be armed), reports the log filter statistics of a stand-in "logcat -S", then
 # stops everything it started.
@@ -50,6 +51,7 @@ ro.quor.build.region=CN
 ro.quor.build.type=1
 ro.serialno=DEMO0001
 persist.sys.orvane.upload_switch=1
+persist.sys.orvane.safecheck=0
 EOF
 # The log filter's statistics: the filter configured, and a stand-in "logcat" first on PATH that
 # prints what the phone's log daemon prints for "logcat -S".
@@ -75,6 +77,8 @@ STATS
 EOF
 chmod 755 "$SANDBOX/bin/logcat"
 export PATH=$SANDBOX/bin:$PATH
+# Activated ten days ago: within the upload period of event_quota.xml.
+echo "persist.sys.orvane.activate_time=$(($(date +%s) - 864000))" >> "$ORVANE_PROPERTY_FILE"
 
 DEVSIM_PID=
 DAEMON_PID=
@@ -123,6 +127,51 @@ wait_for() {
 
 section() { printf '\n== %s\n' "$*"; }
 
+# Log collection on a host: cloud copies of the log rules, with sources that exist on Linux and
+# in the sandbox, and of the privacy policy, which also lets in the sandbox's log folders (the
+# folder "private" stays out, so one source of the wlan rule is refused).
+LOGS=$SANDBOX/logs
+write_log_rules() {
+    mkdir -p "$LOGS/wlan" "$LOGS/tombstones" "$SANDBOX/private"
+    echo "firmware state: halted at 0x1c2f" > "$LOGS/wlan/fw_state.txt"
+    for n in 1 2 3; do
+        head -c $((n * 40000)) /dev/urandom > "$LOGS/wlan/fw_dump_$n.bin"
+        touch -d "-$((4 - n)) min" "$LOGS/wlan/fw_dump_$n.bin"
+    done
+    for n in 00 01 02; do
+        printf 'pid: 42%s, name: com.android.phone\nsignal 11 (SIGSEGV)\n' "$n" > "$LOGS/tombstones/tombstone_$n"
+    done
+    echo "ssid=home psk=secret" > "$SANDBOX/private/wifi_passwords.txt"
+    cat > "$SANDBOX/cloud/event_upload.xml" << EOF
+<EventUpload>
+  <LogRule eventMin="901000000" eventMax="901999999">
+    <Static path="/proc/version"/>
+    <Command cmd="uname -a" timeoutSec="5" file="uname.txt"/>
+  </LogRule>
+  <LogRule eventId="901001001">
+    <Static path="$LOGS/wlan/fw_state.txt"/>
+    <Static path="$SANDBOX/private/wifi_passwords.txt"/>
+    <Dynamic dir="$LOGS/wlan" pattern="fw_dump_\d+\.bin" count="2" maxAgeSec="3600" delete="true"/>
+    <Command cmd="uname -a" timeoutSec="5" file="uname.txt"/>
+  </LogRule>
+  <LogRule eventMin="902000000" eventMax="902999999">
+    <Dynamic dir="$LOGS/tombstones" pattern="tombstone_\d{2}" count="2"/>
+    <Command cmd="ps -e -o pid,comm" timeoutSec="5" file="ps.txt"/>
+  </LogRule>
+  <LogRule eventMin="905000000" eventMax="905999999">
+    <Static path="/proc/diskstats"/>
+    <Command cmd="df -k" timeoutSec="5" file="df.txt"/>
+  </LogRule>
+  <LogRule eventMin="909000000" eventMax="909999999">
+    <Static path="/proc/loadavg"/>
+    <Static path="/proc/meminfo"/>
+  </LogRule>
+</EventUpload>
+EOF
+    sed "s|<LogPaths>|<LogPaths><Allow prefix=\"$LOGS/\"/><Allow prefix=\"$WORK/\"/>|" \
+        "$ROOT/etc/privacy_policy.xml" > "$SANDBOX/cloud/privacy_policy.xml"
+}
+
 section "sandbox $SANDBOX"
 # Performance events: where this kernel takes pressure stall triggers, the demo loads
 # PerfLogAnalyzer 2 s after start instead of 30 and lets it fire on moderate CPU pressure (cloud
@@ -136,6 +185,9 @@ if [ "$MODE" = demo ] && [ "$PERF" = 1 ]; then
   <Resource name="cpu" someStallUs="200000" windowUs="2000000" coolDownSec="600" topCount="5"/>
 </PerfConfig>
 EOF
+fi
+if [ "$MODE" = demo ]; then
+    write_log_rules
 fi
 "$BUILD/orvane-devsim" "$DEV" 2> "$SANDBOX/devsim.log" &
 DEVSIM_PID=$!
@@ -248,6 +300,8 @@ run_demo() {
         echo "after 30 s only $(($(stored) + $(drops))) of $FAULTS fault records were stored or dropped"
     fi
 
+    run_log_demo
+
     if [ -x "$BUILD/orvanectl" ] && [ -S "$WORK/orvane.sock" ]; then
         section "orvanectl dump plugin EventStorageManager query event_daily"
         "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventStorageManager query event_daily || true
@@ -302,6 +356,53 @@ run_demo() {
             sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1 }
         $1 ~ /^source\.EventRadiator\.rejected\./ { rejected += $2 }
         END { printf "%6d records rejected by the source as invalid\n", rejected }' "$SANDBOX/stats.txt"
+}
+
+# The log packs of the faults above, the switch off, a full domain trimmed, and the hand-over.
+run_log_demo() {
+    local ctl=("$BUILD/orvanectl" --workdir "$WORK")
+    packs() { find "$WORK" -name 'EventId_*.zip' | wc -l; }
+    more_packs() { [ "$(packs)" -gt "$1" ]; }
+    pack_of() { [ -n "$(find "$WORK/$1" -name "EventId_*_$2.zip" 2> /dev/null)" ]; }
+    handed_over() { [ -z "$(find "$WORK" -maxdepth 2 -name 'EventId_*.zip' -not -path '*/ue_off/*')" ]; }
+    section "log packs of the faults above"
+    # One pack each of 901001001, 901001002, 902001001, 902001002, 905001001 and 905002001.
+    wait_for 30 more_packs 5 || echo "only $(packs) packs after 30 s"
+    find "$WORK" -name 'EventId_*.zip' -printf '  %P  %s bytes\n' | sort
+    local wlan
+    wlan=$(find "$WORK/901" -maxdepth 1 -name 'EventId_*_901001001.zip' | head -n 1)
+    echo "contents of the wlan crash's pack (unzip -l):"
+    [ -n "$wlan" ] && unzip -l "$wlan" | sed 's/^/  /'
+    echo "the sub-domain's logSpace (60 KiB) at work:"
+    grep -oE "PackLogToZip event 901001001: .*(cut to|left out).*" "$LOG" | sed 's/^PackLogToZip /  /' || true
+    echo "sources refused by the privacy policy: $(grep -c "a log file was refused" "$LOG" || true)" \
+        "(private/wifi_passwords.txt lies outside the allowed folders)"
+    echo "firmware dumps left after packing (the rule deletes what it packed): $(ls "$LOGS/wlan" | tr '\n' ' ')"
+    echo "faults without a pack because logs of their id were caught too recently:"
+    grep -o "CheckIfNeedProcessLog .*" "$LOG" | head -n 3 | sed 's/^/  /' || true
+    "${ctl[@]}" dump stats | grep -E "^(logproc|privacy\.path)\." | sed 's/^/  /'
+
+    section "upload switch off: the next pack goes to ue_off"
+    "${ctl[@]}" upload-switch off
+    wait_for 5 grep -q "persist.sys.orvane.upload_switch=0" "$ORVANE_PROPERTY_FILE" || true
+    printf 'EventId 909001100 -t %s -paraList {}' $((MIDNIGHT + 30000)) > "$QXEV"
+    wait_for 20 pack_of 909/ue_off 909001100 || echo "no pack within 20 s"
+    find "$WORK/909" -name 'EventId_*.zip' -printf '  %P\n'
+    "${ctl[@]}" upload-switch on
+    wait_for 5 grep -q "persist.sys.orvane.upload_switch=1" "$ORVANE_PROPERTY_FILE" || true
+
+    section "the kernel sub-domain is full (2 packs): the next pack first trims it to half"
+    printf 'EventId 901001100 -t %s -paraList {}' $((MIDNIGHT + 31000)) > "$QXEV"
+    wait_for 20 grep -q "CheckAndClearLogFolder domain" "$LOG" || echo "no trim within 20 s"
+    grep -o "CheckAndClearLogFolder domain.*" "$LOG" | tail -n 1 | sed 's/^/  /'
+    wait_for 20 pack_of 901 901001100 || echo "no pack within 20 s"
+    find "$WORK/901" -maxdepth 1 -name 'EventId_*.zip' -printf '  %P\n' | sort
+
+    section "orvanectl pack-log"
+    "${ctl[@]}" pack-log
+    wait_for 10 handed_over || echo "not everything was handed over within 10 s"
+    echo "the work folder afterwards (packs made while the switch was off stay in ue_off):"
+    (cd "$WORK" && find . -name 'EventId_*' -o -type d | sort | sed 's/^/  /')
 }
 
 # CPU pressure from orvane-pressure until the kernel's trigger fires and the event is stored.

@@ -11,6 +11,7 @@
 
 #include <android-base/file.h>
 
+#include "config/event_upload_xml_parser.h"
 #include "config/event_xml_parser.h"
 #include "storage/event_table.h"
 #include "utils/dev_info.h"
@@ -84,6 +85,11 @@ bool EventDatabaseHelper::Init(PluginContext* context, const std::string& fileNa
     }
     context_ = context;
     osVersion_ = osVersion;
+    if (!logRuleLookup_) {
+        logRuleLookup_ = [context](uint32_t eventId) {
+            return EventUploadXmlParser::getInstance()->HasLogRules(*context, eventId);
+        };
+    }
     dbPath_ = context->GetWorkDir() + fileName;
     DaemonStats& stats = context->GetStats();
     stored_ = &stats.Get("storage.events.stored");

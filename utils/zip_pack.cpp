@@ -136,20 +136,20 @@ bool ZipPack::AddFileContentToZip(const std::string& path) {
     return CopyToEntry(fd.get(), path);
 }
 
-bool ZipPack::AddFileFromFd(int fd, const std::string& entryName) {
+bool ZipPack::AddFileFromFd(int fd, const std::string& entryName, uint64_t maxBytes) {
     owner_.Check(__func__);
     if (zipHandle_ == nullptr || fd < 0 || !OpenNewFileInZip(zipHandle_, entryName)) {
         return false;
     }
     // The entry is closed even when copying failed, leaving what was copied.
-    bool copied = CopyToEntry(fd, entryName);
+    bool copied = CopyToEntry(fd, entryName, maxBytes);
     return CloseNewFileEntry(zipHandle_) && copied;
 }
 
-bool ZipPack::CopyToEntry(int fd, const std::string& what) {
+bool ZipPack::CopyToEntry(int fd, const std::string& what, uint64_t maxBytes) {
     char buffer[kCopyBufferSize];
-    while (true) {
-        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buffer, sizeof(buffer)));
+    while (maxBytes > 0) {
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buffer, std::min<uint64_t>(sizeof(buffer), maxBytes)));
         if (n == 0) {
             return true;
         }
@@ -163,7 +163,9 @@ bool ZipPack::CopyToEntry(int fd, const std::string& what) {
                             what.c_str());
             return false;
         }
+        maxBytes -= static_cast<uint64_t>(n);
     }
+    return true;
 }
 
 void ZipPack::Close() {

@@ -54,17 +54,19 @@ public:
     bool AddDirectoryEntryToZip(const std::string& entryName);
     // Copies the file's bytes into the entry that is currently open.
     bool AddFileContentToZip(const std::string& path);
-    // Writes the entry entryName at once from an open descriptor (read from its current offset),
-    // so that what is packed is the file that was opened and checked, whatever its path names now.
-    bool AddFileFromFd(int fd, const std::string& entryName);
+    // Writes the entry entryName at once from an open descriptor (read from its current offset,
+    // at most maxBytes), so that what is packed is the file that was opened and checked, whatever
+    // its path names now, and a file that grows while it is read costs no more than was granted.
+    bool AddFileFromFd(int fd, const std::string& entryName, uint64_t maxBytes = UINT64_MAX);
     // Writes every pending path and finishes the archive; nothing when none is open.
     void Close();
 
 private:
     static constexpr size_t kBatchSize = 50;
 
-    // Copies everything readable from fd into the open entry; `what` names it in log lines.
-    bool CopyToEntry(int fd, const std::string& what);
+    // Copies what is readable from fd, at most maxBytes, into the open entry; `what` names it in
+    // log lines.
+    bool CopyToEntry(int fd, const std::string& what, uint64_t maxBytes = UINT64_MAX);
 
     ThreadChecker owner_;
     zipFile zipHandle_ = nullptr;

@@ -176,7 +176,9 @@ TEST_F(OrvaneServiceTest, CommandsReachTheirTargetsOnlyFromTheCompanion) {
     EXPECT_EQ(Counted("service.refused.process"), 1u);
 
     gPackResult = 7;
-    EXPECT_EQ(Ctl({"pack-log"}), "7\n");
+    EXPECT_EQ(Ctl({"pack-log"}), "7 file(s) handed over for upload\n");
+    gPackResult = -1;
+    EXPECT_EQ(Ctl({"pack-log"}), "-1: uploading is not allowed on this device now, nothing handed over\n");
     Ctl({"run-mode", "factory", "/data/m\xc3\xa9ode.cfg"});
     EXPECT_EQ(DevInfo::GetRunMode(), "factory");
     EXPECT_EQ(SysEnv::GetSysProperity("persist.sys.orvane.run_mode_file", ""), "/data/m\xc3\xa9ode.cfg");
@@ -214,7 +216,7 @@ TEST_F(OrvaneServiceTest, StartServiceServesWithCheckSwitchedOff) {
     EXPECT_EQ(std::filesystem::status(SocketPath()).permissions(), std::filesystem::perms(0660));
     Ctl({"user-activated"}, 0);  // root passes with the check off
     EXPECT_TRUE(WaitUntil([] { return EventsOf(105).size() == 1; }));
-    EXPECT_EQ(Ctl({"pack-log"}, 0), "0\n");
+    EXPECT_EQ(Ctl({"pack-log"}, 0), "0 file(s) handed over for upload\n");
     SysEnv::SetSysProperity("persist.sys.orvane.safecheck", "1");
 }
 

@@ -22,7 +22,7 @@ const char* const kUsage =
         "usage: orvanectl [--workdir DIR] COMMAND [ARGS...]\n"
         "\n"
         "Commands to the daemon (its socket is DIR/orvane.sock, DIR defaults to /data/quorlog/orvane/):\n"
-        "  pack-log               ask for a log pack; prints the daemon's result\n"
+        "  pack-log               hand the log packs over for upload; prints how many files\n"
         "  run-mode NAME FILE     set the run mode\n"
         "  upload-switch on|off   switch uploads on or off\n"
         "  config-update FOLDER   announce new cloud configuration in FOLDER\n"
@@ -138,7 +138,14 @@ int main(int argc, char** argv) {
     }
     int ret = Call(workDir, code, data, &reply);
     if (ret == 0 && code == IOrvaneNativeService::TRANSACTION_notifyPackLog) {
-        printf("%d\n", reply.readInt32());
+        // The daemon answers how many packs and "eventinfo" files it hands over, -1 when this
+        // device may not upload now (switch, factory build, region, sampling or age).
+        int32_t result = reply.readInt32();
+        if (result < 0) {
+            printf("%d: uploading is not allowed on this device now, nothing handed over\n", result);
+        } else {
+            printf("%d file(s) handed over for upload\n", result);
+        }
     }
     return ret;
 }
