@@ -50,6 +50,8 @@ ro.quor.build.type=1
 ro.serialno=DEMO0001
 persist.sys.orvane.upload_switch=1
 EOF
+# Activated just now: "pack-log" admits every device in its first months.
+echo "persist.sys.orvane.activate_time=$(date +%s)" >> "$ORVANE_PROPERTY_FILE"
 
 DEVSIM_PID=
 DAEMON_PID=
@@ -233,6 +235,8 @@ run_demo() {
         "$BUILD/orvanectl" --workdir "$WORK" dump stats | tee "$SANDBOX/stats.txt" || true
     fi
 
+    run_eventinfo_demo
+
     run_perf_demo
 
     section "stopping the daemon and the emulator"
@@ -272,6 +276,28 @@ run_demo() {
     [ -f "$SANDBOX/stats.txt" ] && awk '$1 ~ /^privacy\.dropped\./ && $2 > 0 {
         sub(/^privacy\.dropped\./, "", $1); printf "%6d x dropped by the privacy policy (%s)\n", $2, $1}' "$SANDBOX/stats.txt"
     echo "$(grep -c "ParseEvent event invalid" "$LOG") records rejected by the source as invalid"
+}
+
+# Records of subscribed events (event_upload.xml subscribes the kernel domain 901 and 902001001,
+# 905001001), and their hand-over to the companion app by "pack-log".
+run_eventinfo_demo() {
+    section "a subscribed event's record (first line of $WORK/eventinfo.901)"
+    if ! wait_for 10 test -s "$WORK/eventinfo.901"; then
+        echo "no record of domain 901 within 10 s"
+        return
+    fi
+    head -n 1 "$WORK/eventinfo.901"
+    echo "(serialNo is the serial number DEMO0001 sealed for the upload server; records per file:"
+    for file in "$WORK"/eventinfo.*; do echo "  $(basename "$file"): $(wc -l < "$file")"; done
+    echo ")"
+    section "orvanectl dump plugin EventInfoPack"
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventInfoPack || true
+    section "orvanectl pack-log, then the uploading folders"
+    echo "pack-log answered: $("$BUILD/orvanectl" --workdir "$WORK" pack-log)"
+    wait_for 10 test -e "$WORK/uploading/eventinfo.901" || echo "eventinfo.901 was not handed over within 10 s"
+    (cd "$WORK" && find uploading ./*/uploading -type f 2> /dev/null | sort | sed 's/^\.\///; s/^/  /')
+    echo "left in the work folder: $(cd "$WORK" && ls -d eventinfo.* 2> /dev/null | tr '\n' ' ')"
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventInfoPack | grep '^domain' || true
 }
 
 # CPU pressure from orvane-pressure until the kernel's trigger fires and the event is stored.
