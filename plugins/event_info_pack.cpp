@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <cinttypes>
 
+#include <android-base/file.h>
 #include <android-base/unique_fd.h>
 #include <json/json.h>
 
@@ -272,9 +273,10 @@ void EventInfoPack::AdoptFiles() {
             continue;
         }
         GetDomain(domain).files[path] = st.st_ino;
-        // Appends are synced line by line; a tail without its newline is a power cut's leftover.
+        // Appends are synced line by line; a tail without its newline (or of zeros, where the size
+        // reached the disk before the data) is a power cut's leftover.
         std::string text;
-        if (st.st_size > 0 && FileUtil::LoadStringFromFile(path, text) && !text.empty() && text.back() != '\n') {
+        if (st.st_size > 0 && base::ReadFdToString(fd.get(), &text) && !text.empty() && text.back() != '\n') {
             size_t end = text.rfind('\n');
             off_t keep = end == std::string::npos ? 0 : static_cast<off_t>(end + 1);
             OLOGW("%s %s ends in an unfinished line, cut to %jd bytes", path.c_str(), static_cast<intmax_t>(keep));

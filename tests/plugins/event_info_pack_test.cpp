@@ -211,12 +211,15 @@ TEST_F(EventInfoPackTest, HandOverRestartAndFullDisk) {
     Pass(pack, 901001001, "{}");
     EXPECT_EQ(stats.Value("eventinfo.901.handed_over"), 2u);
 
-    // A power cut's unfinished line is cut at the next load; the files are known again.
+    // What a power cut leaves, an unfinished line or zeros where the size got to the disk before
+    // the data, is cut at the next load; the files are known again.
     const std::string whole = ReadFile(workDir_ + "eventinfo.902");
-    WriteFile(workDir_ + "eventinfo.902", whole + R"({"eventId":9020)");
-    pack.clear();
-    pack = Load();
-    EXPECT_EQ(ReadFile(workDir_ + "eventinfo.902"), whole);
+    for (const std::string& tail : {std::string(R"({"eventId":9020)"), std::string(3, '\0')}) {
+        WriteFile(workDir_ + "eventinfo.902", whole + tail);
+        pack.clear();
+        pack = Load();
+        EXPECT_EQ(ReadFile(workDir_ + "eventinfo.902"), whole);
+    }
     Pass(pack, 902001001, "{}");
     EXPECT_EQ(Records("eventinfo.902").size(), 2u);
     ASSERT_TRUE(FileUtil::MoveFile(workDir_ + "eventinfo.902", workDir_ + "uploading/eventinfo.902"));
