@@ -52,12 +52,14 @@ TEST(EventInfoPlatformTest, SubscribedEventsAreStoredRecordedAndHandedOver) {
     SysEnv::SetSysProperity("ro.quor.build.region", "CN");
     DevInfo::SetActivateTime(TimeUtil::GetTimestampSecond());
     DevInfo::SetUploadSwitch(1);
+    // Before the loops start: mktime's time zone set-up takes a lock of libc's that ThreadSanitizer
+    // does not see.
+    uint64_t day = static_cast<uint64_t>(TimeUtil::GetZeroTimestampSec(TimeUtil::GetTimestampSecond()));
     auto platform = std::make_unique<PluginPlatform>();
     ASSERT_EQ(platform->ParseArgs(9, const_cast<char**>(argv)), 0);
     ASSERT_TRUE(platform->StartPlatform());
     ASSERT_TRUE(WaitUntil([] { return EventInfoTestSource::running_ != nullptr; }));
 
-    uint64_t day = static_cast<uint64_t>(TimeUtil::GetZeroTimestampSec(TimeUtil::GetTimestampSecond()));
     auto publish = [&](uint32_t id, const std::string& params, uint64_t at) {
         EventInfoTestSource::running_.load()->PublishPipelineEvent(MakeEvent(2, id, day + at, params));
     };
