@@ -24,6 +24,11 @@ constexpr size_t kMaxFileNameLength = 64;
 
 constexpr char kRootElement[] = "EventUpload";
 constexpr char kRuleSetElement[] = "LogRule";
+constexpr char kSubscriptionElement[] = "Subscribe";
+constexpr size_t kMaxSubscriptions = 1024;
+// Only records of these ids are handed over for upload ("eventinfo.9xx" files).
+constexpr uint32_t kSubscribableMin = 900000000;
+constexpr uint32_t kSubscribableMax = 999999999;
 constexpr char kRejectedCounter[] = "config.event_upload.rejected";
 
 // Decimal digits only, at most `max`; false for anything else (signs, blanks, units).
@@ -58,6 +63,19 @@ bool IsCommandLine(const std::string& command) {
            });
 }
 
+// The entry of the smallest range that holds id; the first among equal ones.
+template <typename Entry>
+const Entry* FindSmallestRange(const std::vector<Entry>& entries, uint32_t id) {
+    const Entry* best = nullptr;
+    for (const Entry& entry : entries) {
+        if (entry.eventMin <= id && id <= entry.eventMax &&
+            (best == nullptr || entry.eventMax - entry.eventMin < best->eventMax - best->eventMin)) {
+            best = &entry;
+        }
+    }
+    return best;
+}
+
 // Reads one document in element mode into new rules. Lives for one reading only.
 class UploadRulesReader : public XmlParser {
 public:
@@ -75,7 +93,7 @@ public:
             error = "not well-formed XML";
         } else if (!rootError_.empty()) {
             error = rootError_;
-        } else if (!sawRoot_) {
+        } else if (!rootSeen_) {
             error = std::string("no ") + kRootElement + " element";
         }
         if (!error.empty()) {
@@ -87,8 +105,8 @@ public:
 
     bool IsMatch(const std::string& name) override REQUIRES(gXmlDocumentMutex) {
         if (name == kRootElement) {
+            rootSeen_ = true;
             SetStart();
-            sawRoot_ = true;
             return true;
         }
         rootError_ = "root element " + name + " is not " + kRootElement;
@@ -102,6 +120,8 @@ public:
             OpenRuleSet(attributes);
         } else if (name == "Static" || name == "Dynamic" || name == "Command") {
             AddLog(name, attributes);
+        } else if (name == kSubscriptionElement) {
+            AddSubscription(attributes);
         }
         // The root and other elements are left to newer readers.
     }
@@ -128,21 +148,13 @@ private:
             return;
         }
         UploadRules::RuleSet ruleSet;
-        std::string id = GetAttribute(attributes, "eventId");
-        bool ranged = attributes.count("eventMin") != 0 || attributes.count("eventMax") != 0;
-        bool valid =
-                id.empty()
-                        ? ranged && ParseNumber(GetAttribute(attributes, "eventMin"), UINT32_MAX, ruleSet.eventMin) &&
-                                  ParseNumber(GetAttribute(attributes, "eventMax"), UINT32_MAX, ruleSet.eventMax) &&
-                                  ruleSet.eventMin <= ruleSet.eventMax
-                        : !ranged && ParseNumber(id, UINT32_MAX, ruleSet.eventMin);
-        if (!id.empty()) {
-            ruleSet.eventMax = ruleSet.eventMin;
+        std::string why = ReadIdRange(attributes, ruleSet.eventMin, ruleSet.eventMax);
+        if (why.empty() && rules_->ruleSets.size() >= kMaxRuleSets) {
+            why = "more than " + std::to_string(kMaxRuleSets) + " rule sets";
         }
-        if (!valid || rules_->ruleSets.size() >= kMaxRuleSets) {
+        if (!why.empty()) {
             skipping_ = true;
-            Reject(kRuleSetElement, !valid ? "it needs eventId, or eventMin <= eventMax, as decimal ids"
-                                           : "more than " + std::to_string(kMaxRuleSets) + " rule sets");
+            Reject(kRuleSetElement, why);
             return;
         }
         rules_->ruleSets.push_back(std::move(ruleSet));
@@ -173,6 +185,51 @@ private:
             return;
         }
         current_->logs.push_back(std::move(log));
+    }
+
+    // "eventId", or "eventMin" <= "eventMax"; empty when valid, else why not.
+    static std::string ReadIdRange(const std::map<std::string, std::string>& attributes, uint32_t& min, uint32_t& max) {
+        std::string id = GetAttribute(attributes, "eventId");
+        bool ranged = attributes.count("eventMin") != 0 || attributes.count("eventMax") != 0;
+        bool valid = id.empty()
+                             ? ranged && ParseNumber(GetAttribute(attributes, "eventMin"), UINT32_MAX, min) &&
+                                       ParseNumber(GetAttribute(attributes, "eventMax"), UINT32_MAX, max) && min <= max
+                             : !ranged && ParseNumber(id, UINT32_MAX, min);
+        if (!id.empty()) {
+            max = min;
+        }
+        return valid ? "" : "it needs eventId, or eventMin <= eventMax, as decimal ids";
+    }
+
+    void AddSubscription(const std::map<std::string, std::string>& attributes) {
+        if (depth_ > 0) {
+            Reject(kSubscriptionElement, "it stands inside a LogRule");
+            return;
+        }
+        if (rules_->subscriptions.size() >= kMaxSubscriptions) {
+            Reject(kSubscriptionElement, "more than " + std::to_string(kMaxSubscriptions) + " subscriptions");
+            return;
+        }
+        UploadRules::Subscription subscription;
+        std::string why = ReadIdRange(attributes, subscription.eventMin, subscription.eventMax);
+        if (why.empty() && (subscription.eventMin < kSubscribableMin || subscription.eventMax > kSubscribableMax)) {
+            why = "ids must lie in " + std::to_string(kSubscribableMin) + ".." + std::to_string(kSubscribableMax);
+        }
+        if (why.empty() && (!ParseNumber(GetAttribute(attributes, "expire"), UploadRules::Subscription::kMaxExpireDays,
+                                         subscription.expireDays) ||
+                            subscription.expireDays == 0)) {
+            why = "expire must be 1.." + std::to_string(UploadRules::Subscription::kMaxExpireDays) + " days";
+        }
+        std::string visible = GetAttribute(attributes, "visible");
+        if (why.empty() && visible != "true" && visible != "false") {
+            why = "visible must be true or false";
+        }
+        if (!why.empty()) {
+            Reject(kSubscriptionElement, why);
+            return;
+        }
+        subscription.visible = visible == "true";
+        rules_->subscriptions.push_back(subscription);
     }
 
     static std::string ReadStatic(const std::map<std::string, std::string>& attributes, LogCollectInfo& log) {
@@ -239,7 +296,7 @@ private:
     const std::string path_;
     std::shared_ptr<UploadRules> rules_;
     std::string rootError_;
-    bool sawRoot_ = false;
+    bool rootSeen_ = false;                    // set while reading, looked at once the reading is over
     UploadRules::RuleSet* current_ = nullptr;  // the open rule set, into rules_->ruleSets
     int depth_ = 0;                            // LogRule elements open
     bool skipping_ = false;                    // the open rule set was rejected
@@ -260,14 +317,11 @@ void LogCollectInfo::DeleteLogFile() const {
 }
 
 const UploadRules::RuleSet* UploadRules::Find(uint32_t id) const {
-    const RuleSet* best = nullptr;
-    for (const RuleSet& ruleSet : ruleSets) {
-        if (ruleSet.eventMin <= id && id <= ruleSet.eventMax &&
-            (best == nullptr || ruleSet.eventMax - ruleSet.eventMin < best->eventMax - best->eventMin)) {
-            best = &ruleSet;
-        }
-    }
-    return best;
+    return FindSmallestRange(ruleSets, id);
+}
+
+const UploadRules::Subscription* UploadRules::FindSubscription(uint32_t id) const {
+    return FindSmallestRange(subscriptions, id);
 }
 
 sp<EventUploadXmlParser> EventUploadXmlParser::getInstance() {
@@ -291,8 +345,8 @@ std::shared_ptr<const UploadRules> EventUploadXmlParser::ReadRules(const std::st
     if (stats != nullptr && rules->rejected > 0) {
         stats->Add(kRejectedCounter, rules->rejected);
     }
-    OLOGI("%s log rules %s: %zu rule sets, %zu elements left out", path.c_str(), rules->ruleSets.size(),
-          rules->rejected);
+    OLOGI("%s log rules %s: %zu rule sets, %zu subscriptions, %zu elements left out", path.c_str(),
+          rules->ruleSets.size(), rules->subscriptions.size(), rules->rejected);
     return rules;
 }
 

@@ -55,8 +55,9 @@ struct LogCollectInfo {
 };
 
 // One version of the log collection rules "event_upload.xml" (etc/README.md describes the
-// vocabulary): rule sets for one event id or an id range, in document order. Never changed once
-// read, so any thread may query it.
+// vocabulary): rule sets for one event id or an id range, in document order, and the
+// subscriptions of events whose records go to the companion app. Never changed once read, so any
+// thread may query it.
 struct UploadRules {
     struct RuleSet {
         uint32_t eventMin = 0;
@@ -68,8 +69,24 @@ struct UploadRules {
     // ones); null when none does. A rule set without logs means "no logs" for its range.
     const RuleSet* Find(uint32_t id) const;
 
+    // Events of one id or id range that leave a record in an "eventinfo" file: how many days the
+    // companion app keeps it, and whether it shows it to the user.
+    struct Subscription {
+        static constexpr uint32_t kMaxExpireDays = 3650;
+
+        uint32_t eventMin = 0;
+        uint32_t eventMax = 0;
+        uint32_t expireDays = 0;
+        bool visible = false;
+    };
+
+    // The subscription of the smallest range that holds id (the first in the document among
+    // equal ones); null when none does.
+    const Subscription* FindSubscription(uint32_t id) const;
+
     std::string source;  // the document it was read from
     std::vector<RuleSet> ruleSets;
+    std::vector<Subscription> subscriptions;
     size_t rejected = 0;  // elements left out for a bad value
 };
 

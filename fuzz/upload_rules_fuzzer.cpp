@@ -1,7 +1,8 @@
 // libFuzzer target: bytes as the log collection rules "event_upload.xml" (a cloud copy is outside
-// input), read the way the daemon reads them; the rules are then asked what log collection and
-// storage ask: the rule set of a few ids (among them the ids and bounds the input names), and each
-// dynamic source's pattern is matched against names like those of a log folder.
+// input), read the way the daemon reads them; the rules are then asked what log collection, storage
+// and EventInfoPack ask: the rule set and the subscription of a few ids (among them the ids and
+// bounds the input names), and each dynamic source's pattern is matched against names like those
+// of a log folder.
 
 #include <cstddef>
 #include <cstdint>
@@ -37,11 +38,16 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
     std::shared_ptr<const UploadRules> rules = EventUploadXmlParser::ReadRules(path, nullptr);
     Check(rules != nullptr);
-    std::vector<uint32_t> ids = {0, 901001001, UINT32_MAX};
+    std::vector<uint32_t> ids = {0, 901001001, 999999999, UINT32_MAX};
     for (const char* key : {"eventMin=\"", "eventMax=\"", "eventId=\""}) {
         FuzzDocuments::AddNumbersAfter(text, key, 3, ids);
     }
     for (uint32_t id : ids) {
+        const UploadRules::Subscription* subscription = rules->FindSubscription(id);
+        Check(subscription == nullptr ||
+              (subscription->eventMin <= id && id <= subscription->eventMax && subscription->eventMin >= 900000000 &&
+               subscription->eventMax <= 999999999 && subscription->expireDays >= 1 &&
+               subscription->expireDays <= UploadRules::Subscription::kMaxExpireDays));
         const UploadRules::RuleSet* ruleSet = rules->Find(id);
         if (ruleSet == nullptr) {
             continue;

@@ -300,6 +300,7 @@ run_demo() {
         echo "after 30 s only $(($(stored) + $(drops))) of $FAULTS fault records were stored or dropped"
     fi
 
+    run_eventinfo_demo
     run_log_demo
 
     if [ -x "$BUILD/orvanectl" ] && [ -S "$WORK/orvane.sock" ]; then
@@ -401,8 +402,26 @@ run_log_demo() {
     section "orvanectl pack-log"
     "${ctl[@]}" pack-log
     wait_for 10 handed_over || echo "not everything was handed over within 10 s"
+    wait_for 10 test -e "$WORK/uploading/eventinfo.901" || echo "eventinfo.901 was not handed over within 10 s"
     echo "the work folder afterwards (packs made while the switch was off stay in ue_off):"
-    (cd "$WORK" && find . -name 'EventId_*' -o -type d | sort | sed 's/^/  /')
+    (cd "$WORK" && find . -name 'EventId_*' -o -name 'eventinfo.*' -o -type d | sort | sed 's/^/  /')
+    "${ctl[@]}" dump plugin EventInfoPack | grep '^domain' | sed 's/^/  /' || true
+}
+
+# Records of subscribed events (event_upload.xml subscribes the kernel domain 901 and 902001001,
+# 905001001); "pack-log" in the log demo hands them over.
+run_eventinfo_demo() {
+    section "a subscribed event's record (first line of $WORK/eventinfo.901)"
+    if ! wait_for 10 test -s "$WORK/eventinfo.901"; then
+        echo "no record of domain 901 within 10 s"
+        return
+    fi
+    head -n 1 "$WORK/eventinfo.901"
+    echo "(serialNo is the serial number DEMO0001 sealed for the upload server; records per file:"
+    for file in "$WORK"/eventinfo.*; do echo "  $(basename "$file"): $(wc -l < "$file")"; done
+    echo ")"
+    section "orvanectl dump plugin EventInfoPack"
+    "$BUILD/orvanectl" --workdir "$WORK" dump plugin EventInfoPack || true
 }
 
 # CPU pressure from orvane-pressure until the kernel's trigger fires and the event is stored.
