@@ -612,9 +612,8 @@ bool EventLogProcessor::PackLogToZip(sp<Event> event, std::vector<LogSource>& fi
         counters_->packFailed.fetch_add(1, std::memory_order_relaxed);
         return false;
     }
-    if (dir.find(kUeOff) == std::string::npos) {
-        event->SetValue(kKeyZipLogName, dir + "/" + kUploading + "/" + name);
-    }
+    // "zipLogName" already names this pack (CheckIfNeedProcessLog, on the loop): the event is no
+    // longer written here, as the pipeline's listeners read it while the worker packs.
     FileUtil::ChangeMode(placed, kPackMode);
     counters_->packMade.fetch_add(1, std::memory_order_relaxed);
     OLOGI("%s event %u: %s with %" PRIu64 " files", id, placed.c_str(), entries);
@@ -758,7 +757,12 @@ int EventLogProcessor::ProcessUploadingEvent() {
     }
     int moved = 0;
     for (const std::string& file : files) {
+        // A file the app has not taken yet is not replaced: the newcomer gets ".0" appended, which
+        // keeps the name within the event-information pattern.
         std::string target = uploading + "/" + BaseName(file);
+        while (FileUtil::FileExists(target)) {
+            target += ".0";
+        }
         if (FileUtil::MoveFile(file, target)) {
             FileUtil::ChangeMode(target, kPackMode);
             moved++;

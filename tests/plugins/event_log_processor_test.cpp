@@ -399,6 +399,12 @@ TEST_F(EventLogProcessorTest, HandOverMovesPacksAndEventInfo) {
     struct stat st;
     ASSERT_EQ(stat((work + "uploading/eventinfo.906").c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0775u);
+
+    // The app has not taken eventinfo.906 yet: the next one is handed over beside it.
+    Write("/work/eventinfo.906", "y");
+    EXPECT_EQ(Deliver(Fault(101, 1)), 0);
+    ASSERT_TRUE(WaitUntil([&] { return Stat("logproc.handover.eventinfo") == 3; }));
+    EXPECT_EQ(Read(work + "uploading/eventinfo.906") + Read(work + "uploading/eventinfo.906.0"), "xy");
 }
 
 // A disk that fills while a pack is written (here: a file size limit of the process) leaves no
