@@ -35,10 +35,11 @@ constexpr const char* kCompanionSuffixes[] = {"-journal", "-wal", "-shm"};
 // Rows per trimming statement: each statement's journal must fit on a nearly full disk; a
 // statement that still fails is retried with half as many rows.
 constexpr int64_t kDeleteBatchRows = 256;
-// What every stored event looks up: its counter row by id, and the day's row of its id in
-// event_info. Without them each lookup reads the whole table.
+// What every stored event looks up: its counter row by id, and the day's row of its id and
+// parameter text in event_info. Without them each lookup reads the whole table; with the time
+// alone it would read every row of the id's day.
 constexpr const char* kIndexes[] = {
-        "CREATE INDEX IF NOT EXISTS event_info_event_time ON event_info(event_id, first_time)",
+        "CREATE INDEX IF NOT EXISTS event_info_day_lookup ON event_info(event_id, param_list, first_time)",
         "CREATE INDEX IF NOT EXISTS event_daily_event ON event_daily(event_id)",
 };
 

@@ -235,7 +235,7 @@ TEST_F(SqlFileTest, OldFileIsUpgradedOnce) {
         // the query builder quotes them.
         EXPECT_EQ(
                 Column(path_, "select name from sqlite_master where type = 'index' and sql is not null order by name"),
-                (Texts{"event_daily_event", "event_info_event_time"}));
+                (Texts{"event_daily_event", "event_info_day_lookup"}));
         const std::string plans[] = {
                 "explain query plan select id,occured_cnt from event_info where event_id = '901' and version_id = "
                 "'1' and param_list = 'p' and first_time >= '100' and first_time < '86500' limit 1",

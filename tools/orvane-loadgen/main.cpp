@@ -205,6 +205,7 @@ int Throughput(int node, DaemonCounters& counters, pid_t pid, uint32_t ids, doub
 
     ProcessUsage before = ReadUsage(pid);
     uint64_t commitsBefore = counters.Commits();
+    uint64_t storedBefore = counters.Get("storage.events.stored");
     MemoryPeak memory;
     Clock::time_point start = Clock::now();
     Clock::time_point lastPoll = start;
@@ -229,21 +230,23 @@ int Throughput(int node, DaemonCounters& counters, pid_t pid, uint32_t ids, doub
     memory.Sample(pid);
     ProcessUsage after = ReadUsage(pid);
     uint64_t events = written - first;
-    uint64_t stored = counters.Get("storage.events.stored");
-    printf("ids=%u events=%llu write_s=%.1f drained_s=%.1f end_to_end_per_s=%.0f commits_per_event=%s "
-           "disk_bytes_per_event=%.0f write_calls_per_event=%.2f daemon_cpu_us_per_event=%.1f pss_kb=%ld "
-           "private_dirty_kb=%ld daemon_peak_rss_kb=%ld stored_total=%llu written=%llu%s\n",
-           ids, static_cast<unsigned long long>(events), writeSeconds, totalSeconds, events / totalSeconds,
-           counters.Has("storage.db.commits")
-                   ? std::to_string(static_cast<double>(counters.Commits() - commitsBefore) / events)
-                             .substr(0, 5)
-                             .c_str()
-                   : "n/a",
-           static_cast<double>(after.writeBytes - before.writeBytes) / events,
+    uint64_t stored = counters.Get("storage.events.stored") - storedBefore;
+    uint64_t diskBytes = after.writeBytes - before.writeBytes;
+    std::string commits = "n/a";
+    if (counters.Has("storage.db.commits")) {
+        char text[32];
+        snprintf(text, sizeof(text), "%.3f", static_cast<double>(counters.Commits() - commitsBefore) / events);
+        commits = text;
+    }
+    printf("ids=%u events=%llu stored=%llu write_s=%.1f drained_s=%.1f end_to_end_per_s=%.0f stored_per_s=%.0f "
+           "commits_per_event=%s disk_bytes_per_event=%.0f disk_bytes_per_stored=%.0f write_calls_per_event=%.2f "
+           "daemon_cpu_us_per_event=%.1f pss_kb=%ld private_dirty_kb=%ld daemon_peak_rss_kb=%ld written=%llu%s\n",
+           ids, static_cast<unsigned long long>(events), static_cast<unsigned long long>(stored), writeSeconds,
+           totalSeconds, events / totalSeconds, stored / totalSeconds, commits.c_str(),
+           static_cast<double>(diskBytes) / events, stored > 0 ? static_cast<double>(diskBytes) / stored : 0.0,
            static_cast<double>(after.writeCalls - before.writeCalls) / events,
            (after.cpuSeconds - before.cpuSeconds) * 1e6 / events, memory.pssKb, memory.privateDirtyKb, after.peakRssKb,
-           static_cast<unsigned long long>(stored), static_cast<unsigned long long>(written),
-           drained ? "" : " NOT_DRAINED");
+           static_cast<unsigned long long>(written), drained ? "" : " NOT_DRAINED");
     return drained ? 0 : 1;
 }
 
