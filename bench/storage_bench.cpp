@@ -54,8 +54,9 @@ private:
     std::string path_;
 };
 
-// Fills event_info with `rows` events of the same day under other parameter texts, in one
-// transaction, so that the day lookup has to pass them all.
+// Fills event_info with `rows` events of 5,000 other ids over the last 60 days, in one
+// transaction: a store that has grown, while the benchmark's own id has only the rows of today
+// that the run adds (on a phone its daily quota bounds them).
 void Prefill(const std::string& dbPath, int64_t rows, uint64_t day) {
     sqlite3* db = nullptr;
     sqlite3_open(dbPath.c_str(), &db);
@@ -64,8 +65,8 @@ void Prefill(const std::string& dbPath, int64_t rows, uint64_t day) {
         std::string sql =
                 "insert into event_info (event_id,version_id,occured_cnt,first_time,param_list,expire,visible) "
                 " values ( " +
-                std::to_string(kEventId) + ",1,1," + std::to_string(day + 50) + ",'{\"prefill\":" + std::to_string(i) +
-                "}',0,0) ";
+                std::to_string(kEventId + 1 + i % 5000) + ",1,1," + std::to_string(day + 50 - 86400 * (i / 5000 % 60)) +
+                ",'{\"prefill\":" + std::to_string(i) + "}',0,0) ";
         sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
     }
     sqlite3_exec(db, "COMMIT", nullptr, nullptr, nullptr);
@@ -75,7 +76,7 @@ void Prefill(const std::string& dbPath, int64_t rows, uint64_t day) {
 // A database made by the real code and prefilled with `rows` rows, in `folder`. A big prefill is
 // made once and kept under $ORVANE_BENCH_DIR, then copied: its day is the one stored in it.
 void MakeDatabase(const std::string& folder, int64_t rows) {
-    std::string kept = BenchRoot() + "orvane_bench_event_info_" + std::to_string(rows) + ".db";
+    std::string kept = BenchRoot() + "orvane_bench_grown_" + std::to_string(rows) + ".db";
     if (rows >= 100000 && FileUtil::FileExists(kept)) {
         std::ifstream in(kept, std::ios::binary);
         std::ofstream(folder + "event.db", std::ios::binary) << in.rdbuf();
