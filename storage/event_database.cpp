@@ -12,6 +12,7 @@
 
 #include <android-base/file.h>
 #include <utils/Mutex.h>
+#include <utils/Timers.h>
 
 #include "storage/event_table.h"
 #include "utils/file_util.h"
@@ -34,6 +35,13 @@ constexpr const char* kCompanionSuffixes[] = {"-journal", "-wal", "-shm"};
 // Rows per trimming statement: each statement's journal must fit on a nearly full disk; a
 // statement that still fails is retried with half as many rows.
 constexpr int64_t kDeleteBatchRows = 256;
+// What every stored event looks up: its counter row by id, and the day's rows of its id in
+// event_info, which the daily quota keeps few. Without them each lookup reads the whole table.
+// The parameter text stays out of the index: it can be kilobytes, and would be stored twice.
+constexpr const char* kIndexes[] = {
+        "CREATE INDEX IF NOT EXISTS event_info_day_lookup ON event_info(event_id, first_time)",
+        "CREATE INDEX IF NOT EXISTS event_daily_event ON event_daily(event_id)",
+};
 
 void Bump(DaemonStats::Counter* counter) {
     if (counter != nullptr) {
@@ -68,6 +76,10 @@ void EventDatabase::SetStats(DaemonStats* stats) {
     errors_ = stats != nullptr ? &stats->Get("storage.db.errors") : nullptr;
     recovered_ = stats != nullptr ? &stats->Get("storage.db.recovered") : nullptr;
     linksRefused_ = stats != nullptr ? &stats->Get("storage.db.link_refused") : nullptr;
+    commits_ = stats != nullptr ? &stats->Get("storage.db.commits") : nullptr;
+    committedEvents_ = stats != nullptr ? &stats->Get("storage.events.committed") : nullptr;
+    batchesRescued_ = stats != nullptr ? &stats->Get("storage.db.batch_rescued") : nullptr;
+    eventsLost_ = stats != nullptr ? &stats->Get("storage.events.lost") : nullptr;
 }
 
 void EventDatabase::InitDatabase(const std::string& path) {
@@ -93,6 +105,8 @@ void EventDatabase::InitDatabase(const std::string& path) {
 }
 
 void EventDatabase::OpenFile() {
+    // A batch open on a file that is being replaced went with it.
+    ForgetBatch();
     bool existed = FileUtil::FileExists(database_->GetPath());
     if (!database_->Open()) {
         Bump(errors_);
@@ -108,27 +122,127 @@ void EventDatabase::OpenFile() {
             OLOG_AS(ANDROID_LOG_INFO, "InitDatabase", "%s update failed");
         }
     }
+    for (const char* index : kIndexes) {
+        Run(index);
+    }
 }
 
 bool EventDatabase::Run(const std::string& sql) {
     owner_.Check(__func__);
-    if (database_->ExecuteSql(sql)) {
-        return true;
+    if (inEvent_ && !batchOpen_) {
+        OpenBatch();
     }
-    if (!Failed()) {
-        return false;
+    bool ok = database_->ExecuteSql(sql);
+    if (!ok && Failed()) {
+        ok = database_->ExecuteSql(sql);
+        if (!ok) {
+            Bump(errors_);
+        }
+    } else if (!ok && batchOpen_ && !database_->InTransaction()) {
+        RescueBatch();
     }
-    if (database_->ExecuteSql(sql)) {
-        return true;
+    if (ok && batchOpen_) {
+        if (!eventInBatch_) {
+            batch_.emplace_back();
+            eventInBatch_ = true;
+        }
+        batch_.back().push_back(sql);
+    } else if (ok) {
+        Bump(commits_);
+    }
+    return ok;
+}
+
+void EventDatabase::BeginEvent() {
+    owner_.Check(__func__);
+    inEvent_ = true;
+    eventInBatch_ = false;
+}
+
+bool EventDatabase::EndEvent() {
+    owner_.Check(__func__);
+    inEvent_ = false;
+    eventInBatch_ = false;
+    return batchOpen_ &&
+           (batch_.size() >= kMaxBatchEvents || systemTime(SYSTEM_TIME_MONOTONIC) - batchOpenedNs_ >= kMaxBatchNs);
+}
+
+void EventDatabase::OpenBatch() {
+    if (!initialised_) {
+        return;
+    }
+    // IMMEDIATE takes the write lock now (waiting out the busy time-out), so that no statement of
+    // the batch can meet a lock later.
+    if (!database_->ExecuteSql("BEGIN IMMEDIATE")) {
+        Bump(errors_);
+        return;
+    }
+    batchOpen_ = true;
+    batchOpenedNs_ = systemTime(SYSTEM_TIME_MONOTONIC);
+}
+
+void EventDatabase::Commit() {
+    owner_.Check(__func__);
+    CommitBatch();
+}
+
+void EventDatabase::CommitBatch() {
+    if (!batchOpen_) {
+        return;
+    }
+    if (database_->ExecuteSql("COMMIT")) {
+        Bump(commits_);
+        if (committedEvents_ != nullptr) {
+            committedEvents_->fetch_add(batch_.size(), std::memory_order_relaxed);
+        }
+        ForgetBatch();
+        return;
     }
     Bump(errors_);
-    return false;
+    database_->Execute("ROLLBACK", false);
+    RescueBatch();
+}
+
+// SQLite rolls a transaction back by itself on some failures (a full disk, an I/O error), and a
+// failed COMMIT leaves nothing stored. The batch's events are then run again, each in a
+// transaction of its own, so that only an event that fails again is lost.
+void EventDatabase::RescueBatch() {
+    std::vector<std::vector<std::string>> events = std::move(batch_);
+    ForgetBatch();
+    Bump(batchesRescued_);
+    for (const auto& statements : events) {
+        bool ok = database_->ExecuteSql("BEGIN IMMEDIATE");
+        for (size_t i = 0; ok && i < statements.size(); i++) {
+            ok = database_->ExecuteSql(statements[i]);
+        }
+        if (ok && database_->ExecuteSql("COMMIT")) {
+            Bump(commits_);
+            Bump(committedEvents_);
+            continue;
+        }
+        database_->Execute("ROLLBACK", false);
+        Bump(eventsLost_);
+    }
+    OLOGE_LIMITED("%s a shared transaction of %zu events failed, each was run again on its own", events.size());
+}
+
+void EventDatabase::ForgetBatch() {
+    batchOpen_ = false;
+    eventInBatch_ = false;
+    batch_.clear();
 }
 
 std::vector<SqlRow> EventDatabase::Fetch(const std::string& sql, const std::vector<std::string>& fieldNames) {
     owner_.Check(__func__);
     std::vector<SqlRow> rows = database_->QueryRecord(sql, fieldNames);
-    if (database_->GetLastCode() == SQLITE_OK || !Failed()) {
+    if (database_->GetLastCode() == SQLITE_OK) {
+        return rows;
+    }
+    if (!Failed()) {
+        // A read that had to make room in the page cache writes, and may fail like a write.
+        if (batchOpen_ && !database_->InTransaction()) {
+            RescueBatch();
+        }
         return rows;
     }
     rows = database_->QueryRecord(sql, fieldNames);
@@ -324,10 +438,11 @@ bool EventDatabase::TruncateAndCreate(const std::string& table) {
         return false;
     }
     owner_.Check(__func__);
-    if (!database_->TruncateTable(table)) {
-        Failed();
+    if (!Run("delete from " + table)) {
+        OLOGW_LIMITED("%s failed truncate table %s", table.c_str());
         return false;
     }
+    Run("DELETE FROM sqlite_sequence WHERE name='" + table + "'");
     sp<BaseTable> tbl = GetTable(table);
     if (tbl == nullptr) {
         return false;
@@ -383,6 +498,7 @@ bool EventDatabase::Vacuum() {
         OLOGE_LIMITED("%s database not init");
         return false;
     }
+    Commit();
     return Run("VACUUM");
 }
 
@@ -401,13 +517,15 @@ int64_t EventDatabase::GetLiveSize() {
 void EventDatabase::Close() {
     if (database_ != nullptr) {
         OLOGI("%s event data base closed");
+        CommitBatch();
         initialised_ = false;
         database_->Close();
         database_ = nullptr;
         tables_.clear();
     }
     recoveryListener_ = nullptr;
-    errors_ = recovered_ = linksRefused_ = nullptr;
+    errors_ = recovered_ = linksRefused_ = commits_ = committedEvents_ = batchesRescued_ = eventsLost_ = nullptr;
+    inEvent_ = false;
     owner_.Detach();
 }
 

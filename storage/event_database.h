@@ -54,7 +54,17 @@ public:
     bool TruncateAndCreate(const std::string& table);
     // Adds the declared columns that the file's table lacks.
     bool UpdateTableColumn(const sp<BaseTable>& table);
-    // Rebuilds the file so that the space of deleted rows is given back.
+    // Group commit. The statements of one event run between BeginEvent and EndEvent; the events
+    // of a batch share one transaction, which their first write opens and Commit closes. Outside
+    // BeginEvent and EndEvent each statement commits on its own. EndEvent tells whether the batch
+    // is due: kMaxBatchEvents events in it, or kMaxBatchNs since it opened.
+    static constexpr size_t kMaxBatchEvents = 256;
+    static constexpr int64_t kMaxBatchNs = 100000000;
+    void BeginEvent();
+    bool EndEvent();
+    bool HasOpenBatch() const { return batchOpen_; }
+    void Commit();
+    // Rebuilds the file so that the space of deleted rows is given back; commits an open batch first.
     bool Vacuum();
     // Bytes of the pages that hold data, which is what a vacuum would leave; -1 on failure.
     int64_t GetLiveSize();
@@ -77,15 +87,30 @@ private:
     int64_t DeleteInBatches(const std::string& table, const std::string& timeColumn, const std::string& condition,
                             int64_t maxRows);
     void RaiseDbRevision();
+    void OpenBatch();
+    void CommitBatch();
+    void RescueBatch();
+    void ForgetBatch();
 
     bool initialised_ = false;
     sp<SqlDatabase> database_;
     std::map<std::string, sp<BaseTable>> tables_;
     bool recovering_ = false;
     RecoveryListener recoveryListener_;
+    bool inEvent_ = false;
+    bool batchOpen_ = false;
+    int64_t batchOpenedNs_ = 0;
+    // The write statements of each event in the open batch, to run again should SQLite roll the
+    // batch back on a failure; the last entry is the event under way once it has written.
+    std::vector<std::vector<std::string>> batch_;
+    bool eventInBatch_ = false;
     DaemonStats::Counter* errors_ = nullptr;
     DaemonStats::Counter* recovered_ = nullptr;
     DaemonStats::Counter* linksRefused_ = nullptr;
+    DaemonStats::Counter* commits_ = nullptr;
+    DaemonStats::Counter* committedEvents_ = nullptr;
+    DaemonStats::Counter* batchesRescued_ = nullptr;
+    DaemonStats::Counter* eventsLost_ = nullptr;
     ThreadChecker owner_;
 };
 

@@ -117,6 +117,34 @@ EVENT_RET EventStorageManager::OnEvent(sp<Event>& event) {
     if (event == nullptr) {
         return 0;
     }
+    sp<EventDatabase> database = EventDatabase::getInstance();
+    database->BeginEvent();
+    EVENT_RET result = Store(event);
+    sp<EventLoop> loop = GetLooper();
+    if (database->EndEvent() || loop == nullptr) {
+        database->Commit();
+    } else if (database->HasOpenBatch()) {
+        QueueCommit(loop);
+    }
+    return result;
+}
+
+void EventStorageManager::QueueCommit(const sp<EventLoop>& loop) {
+    if (commitQueued_) {
+        return;
+    }
+    commitQueued_ = true;
+    wp<EventStorageManager> weak = this;
+    loop->AddTask([weak]() {
+        sp<EventStorageManager> self = weak.promote();
+        if (self != nullptr) {
+            self->commitQueued_ = false;
+            EventDatabase::getInstance()->Commit();
+        }
+    });
+}
+
+EVENT_RET EventStorageManager::Store(sp<Event>& event) {
     OLOGD("%s EventStorageManager event=%u,%d", event->eventId, static_cast<int>(event->eventType));
     switch (event->eventType) {
         case kCategoryRaw:

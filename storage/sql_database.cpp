@@ -12,6 +12,15 @@ namespace Orvane {
 namespace {
 constexpr int64_t kSoftHeapLimit = 102400;
 constexpr mode_t kDbFileMode = 0640;
+// Set up as Android sets up its own system databases. A write-ahead log: a commit appends the
+// pages it changed to "-wal" and a reader never blocks the writer. Synchronous NORMAL: the log
+// is synced only when it is checkpointed into the file, so a killed process loses no commit and
+// a power loss loses at most the commits since the last checkpoint, never the file's integrity.
+// The log is checkpointed once it holds 100 pages and cut back to 512 KiB afterwards.
+constexpr const char* kPragmas[] = {
+        "PRAGMA cache_size=10;",          "PRAGMA journal_mode=WAL;",          "PRAGMA synchronous=NORMAL;",
+        "PRAGMA wal_autocheckpoint=100;", "PRAGMA journal_size_limit=524288;",
+};
 
 const char* TypeWord(SqlFieldType type) {
     switch (type) {
@@ -151,11 +160,10 @@ bool SqlDatabase::Open() {
         return false;
     }
     sqlite3_busy_timeout(handle_, kBusyTimeoutMs);
-    if (!Execute("PRAGMA cache_size=10;", false)) {
-        OLOGE("%s failed db %s set cache size, %s", path_.c_str(), lastError_.c_str());
-    }
-    if (!Execute("PRAGMA synchronous=1;", false)) {
-        OLOGE("%s failed db %s set synchronous, %s", path_.c_str(), lastError_.c_str());
+    for (const char* pragma : kPragmas) {
+        if (!Execute(pragma, false)) {
+            OLOGE("%s failed db %s set %s, %s", path_.c_str(), pragma, lastError_.c_str());
+        }
     }
     FileUtil::ChangeMode(path_, kDbFileMode);
     return true;
@@ -195,6 +203,10 @@ bool SqlDatabase::Execute(const std::string& sql, bool wantRows) {
 
 bool SqlDatabase::LastFailureIsCorruption() const {
     return lastCode_ == SQLITE_CORRUPT || lastCode_ == SQLITE_NOTADB;
+}
+
+bool SqlDatabase::InTransaction() const {
+    return handle_ != nullptr && sqlite3_get_autocommit(handle_) == 0;
 }
 
 int64_t SqlDatabase::GetChanges() const {
@@ -239,18 +251,6 @@ std::vector<SqlRow> SqlDatabase::QueryRecord(const std::string& sql, const std::
     }
     expectedFieldNames_.clear();
     return results_;
-}
-
-bool SqlDatabase::TruncateTable(const std::string& table) {
-    if (handle_ == nullptr) {
-        return false;
-    }
-    if (!Execute("delete from " + table, false)) {
-        OLOGW_LIMITED("%s failed truncate table %s:%s, %s", path_.c_str(), table.c_str(), lastError_.c_str());
-        return false;
-    }
-    Execute("DELETE FROM sqlite_sequence WHERE name='" + table + "'", false);
-    return true;
 }
 
 }  // namespace Orvane

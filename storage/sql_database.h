@@ -89,8 +89,6 @@ public:
     bool ExecuteSql(const std::string& sql);
     // Rows keyed by `fieldNames`, which must list the selected columns in SELECT order.
     std::vector<SqlRow> QueryRecord(const std::string& sql, const std::vector<std::string>& fieldNames);
-    // Deletes every row and restarts the table's AUTOINCREMENT counter.
-    bool TruncateTable(const std::string& table);
 
     const std::string& GetPath() const { return path_; }
     const std::string& GetLastError() const { return lastError_; }
@@ -98,6 +96,8 @@ public:
     int GetLastCode() const { return lastCode_; }
     // True when the last open or statement found that the file is no database or is damaged.
     bool LastFailureIsCorruption() const;
+    // True between BEGIN and its COMMIT or ROLLBACK, which SQLite may do itself on a failure.
+    bool InTransaction() const;
     // Rows changed by the last statement.
     int64_t GetChanges() const;
     bool IsOpen() const { return handle_ != nullptr; }

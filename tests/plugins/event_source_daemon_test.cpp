@@ -62,7 +62,11 @@ protected:
             return 0;
         };
         sqlite3* db = nullptr;
-        if (system(("cp " + folder_ + "/work/event.db " + copy + " 2>/dev/null").c_str()) == 0 &&
+        // The write-ahead log holds the latest commits until they are checkpointed into the file.
+        std::string work = folder_ + "/work/event.db";
+        if (system(("cp " + work + " " + copy + " 2>/dev/null && rm -f " + copy + "-wal " + copy + "-shm && { cp " +
+                    work + "-wal " + copy + "-wal 2>/dev/null; true; }")
+                           .c_str()) == 0 &&
             sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK)
             sqlite3_exec(db, sql.c_str(), append, &rows, nullptr);
         sqlite3_close(db);

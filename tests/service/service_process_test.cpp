@@ -152,11 +152,15 @@ protected:
     pid_t daemon_ = -1;
 };
 
-// Rows of `bytes` each in raw_events, written beside the running daemon, which is idle.
+// Rows of `bytes` each in raw_events, written beside the running daemon, which is idle once its
+// storage loop has made the table.
 void FillRawEvents(const std::string& database, int rows, size_t bytes) {
     sqlite3* db = nullptr;
     ASSERT_EQ(sqlite3_open(database.c_str(), &db), SQLITE_OK);
     sqlite3_busy_timeout(db, 10000);
+    EXPECT_TRUE(WaitUntil([&] {
+        return sqlite3_exec(db, "select count(*) from raw_events", nullptr, nullptr, nullptr) == SQLITE_OK;
+    }));
     std::string sql = "begin;";
     for (int i = 0; i < rows; ++i)
         sql += "insert into raw_events(event_id, param_list, timestamp) values(100001, '" + std::string(bytes, 'p') +

@@ -60,7 +60,7 @@ TEST_F(EventStorageManagerTest, RoutesByCategoryAndId) {
     for (const auto& [type, id] : events)
         results += Deliver(type, id, now + id % 7) + " ";
     EXPECT_EQ(results, "-1 -1 -1 0 0 0 0 0 0/1 0/2 0 0 0 0 ");
-    EXPECT_EQ(Column(path_, "select event_id from event_info"),
+    EXPECT_EQ(Column(path_, "select event_id from event_info order by id"),
               (Texts{"900000000", "800000000", "888888888", "999999999"}));
     EXPECT_EQ(Column(path_, "select activate_time from db_version"), Texts{std::to_string(now + 105 % 7)});
 }
@@ -102,6 +102,40 @@ TEST_F(EventStorageManagerTest, DumpCommands) {
     EXPECT_EQ(rows.substr(0, rows.find('\n', rows.find('\n') + 1) + 1),
               "id | event_id | trace_id | pspan_id | span_id | version_id | occured_cnt | first_time | param_list | "
               "expire | visible\n25 | 901000024 |  |  |  | 1 | 1 | 100 | row24 | 0 | 0\n");
+}
+
+// Events queued behind each other share a transaction, at most EventDatabase::kMaxBatchEvents of
+// them; a lone event is committed before the loop turns to anything else. Every event is stored.
+TEST_F(EventStorageManagerTest, BacklogSharesCommitsAndALoneEventCommitsAtOnce) {
+    plugin_->OnLoad();
+    uint64_t now = DbStartTime() + 10;
+    auto stat = [&](const char* name) { return context_.GetStats().Value(name); };
+    uint64_t commitsBefore = stat("storage.db.commits");
+    const uint32_t backlog = 2 * EventDatabase::kMaxBatchEvents + 100;
+    std::promise<void> release;
+    std::shared_future<void> released = release.get_future().share();
+    plugin_->GetLooper()->AddTask([released] { released.wait(); });
+    for (uint32_t i = 0; i < backlog; i++) {
+        sp<Event> event = MakeEvent(2, 901000000 + i, now, "queued");
+        plugin_->GetLooper()->AddTask([this, event]() mutable { plugin_->OnEvent(event); });
+    }
+    release.set_value();
+    ASSERT_TRUE(WaitUntil([&] { return stat("storage.events.committed") == backlog; }))
+            << stat("storage.events.committed");
+    // Three full batches at most, and the commit queued behind the backlog.
+    uint64_t commits = stat("storage.db.commits") - commitsBefore;
+    EXPECT_GE(commits, 3u);
+    EXPECT_LE(commits, 4u);
+    EXPECT_EQ(Column(path_, "select count(*) from event_info where param_list = 'queued'"),
+              Texts{std::to_string(backlog)});
+
+    // The commit of a lone event is the next entry of the loop: a task queued after it sees it on disk.
+    Deliver(2, 902000001, now, "alone");
+    std::promise<Texts> seen;
+    plugin_->GetLooper()->AddTask(
+            [&] { seen.set_value(Column(path_, "select count(*) from event_info where param_list = 'alone'")); });
+    EXPECT_EQ(seen.get_future().get(), Texts{"1"});
+    EXPECT_EQ(stat("storage.events.committed"), backlog + 1);
 }
 
 }  // namespace android::Orvane

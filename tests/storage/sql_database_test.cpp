@@ -30,25 +30,39 @@ namespace android::Orvane {
 struct FaultyVfs {
     static inline std::atomic<int64_t> writeBudget{-1};  // bytes still writable; -1 means unlimited
     static inline std::atomic<bool> readOnly{false};
+    static inline std::atomic<int> failWrites{0};  // writes that fail before the disk has room again
     static inline sqlite3_vfs *real = nullptr, vfs;
-    static inline const sqlite3_io_methods* realIo = nullptr;
-    static inline sqlite3_io_methods io;
+    // The platform gives the database, its journal and its write-ahead log methods of their own;
+    // each gets a copy whose writes go through Write.
+    static inline const sqlite3_io_methods* realIo[4] = {};
+    static inline sqlite3_io_methods io[4];
 
     static int Write(sqlite3_file* file, const void* buffer, int size, sqlite3_int64 offset) {
+        if (failWrites > 0 && failWrites-- > 0)
+            return SQLITE_FULL;
         int64_t budget = writeBudget.load();
         if (budget >= 0)
             writeBudget = budget < size ? 0 : budget - size;
-        return budget >= 0 && budget < size ? SQLITE_FULL : realIo->xWrite(file, buffer, size, offset);
+        if (budget >= 0 && budget < size)
+            return SQLITE_FULL;
+        for (size_t i = 0; i < std::size(io); i++)
+            if (file->pMethods == &io[i])
+                return realIo[i]->xWrite(file, buffer, size, offset);
+        return SQLITE_IOERR_WRITE;
     }
     // Opens with the platform's file system, then sends the file's writes through Write.
     static int Open(sqlite3_vfs*, sqlite3_filename name, sqlite3_file* file, int flags, int* outFlags) {
         if (readOnly && (flags & SQLITE_OPEN_MAIN_DB) != 0)
             flags = (flags & ~(SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)) | SQLITE_OPEN_READONLY;
         int rc = real->xOpen(real, name, file, flags, outFlags);
-        if (rc == SQLITE_OK && realIo == nullptr)
-            io = *(realIo = file->pMethods), io.xWrite = Write;
-        if (rc == SQLITE_OK && file->pMethods == realIo)
-            file->pMethods = &io;
+        for (size_t i = 0; rc == SQLITE_OK && file->pMethods != nullptr && i < std::size(io); i++) {
+            if (realIo[i] == nullptr)
+                io[i] = *(realIo[i] = file->pMethods), io[i].xWrite = Write;
+            if (file->pMethods == realIo[i]) {
+                file->pMethods = &io[i];
+                break;
+            }
+        }
         return rc;
     }
     // Makes the faulty file system the default one; idempotent.
@@ -63,7 +77,7 @@ struct FaultyVfs {
         }
     }
     // Restores a healthy disk.
-    static void Heal() { writeBudget = -1, readOnly = false; }
+    static void Heal() { writeBudget = -1, readOnly = false, failWrites = 0; }
 };
 
 TEST(EventTableTest, StatementTexts) {
@@ -178,11 +192,12 @@ protected:
         for (int i = 0; i < n; i++)
             helper_->ProcessFaultEvent(MakeEvent(2, 902000000 + i, now_ - 100 + i, tag + std::to_string(i)));
     }
-    // The files of the work folder but the database itself, by name.
+    // The files of the work folder but the database itself and its write-ahead log, by name.
     Texts Others() {
         Texts names;
         for (const auto& entry : std::filesystem::directory_iterator(dir_.path_))
-            if (entry.path().filename() != "event.db")
+            if (entry.path().filename() != "event.db" && entry.path().filename() != "event.db-wal" &&
+                entry.path().filename() != "event.db-shm")
                 names.push_back(entry.path().filename());
         std::sort(names.begin(), names.end());
         return names;
@@ -216,6 +231,20 @@ TEST_F(SqlFileTest, OldFileIsUpgradedOnce) {
         EXPECT_EQ(Column(path_, "select event_id || '/' || ifnull(last_log_time, '-') from event_daily"), Texts{"9/-"});
         // The six tables and sqlite_sequence.
         EXPECT_EQ(Column(path_, "select count(*) from sqlite_master where type = 'table'"), Texts{"7"});
+        // The lookups of every stored event find their rows through an index, with values quoted as
+        // the query builder quotes them.
+        EXPECT_EQ(
+                Column(path_, "select name from sqlite_master where type = 'index' and sql is not null order by name"),
+                (Texts{"event_daily_event", "event_info_day_lookup"}));
+        const std::string plans[] = {
+                "explain query plan select id,occured_cnt from event_info where event_id = '901' and version_id = "
+                "'1' and param_list = 'p' and first_time >= '100' and first_time < '86500' limit 1",
+                "explain query plan select id from event_daily where event_id = '901' limit 1"};
+        for (const auto& plan : plans) {
+            Texts steps = Column(path_, plan, 3);  // the plan step's text
+            ASSERT_EQ(steps.size(), 1u) << plan;
+            EXPECT_NE(steps[0].find(" INDEX event_"), std::string::npos) << steps[0];
+        }
     }
 }
 
@@ -231,6 +260,7 @@ TEST_F(SqlFileTest, HostileTextsRoundTripByteExact) {
 TEST_F(SqlFileTest, FileThatIsNoDatabaseFailsLoudlyAndIsLeftAlone) {
     LogCapture log;
     const std::string garbage = "this is no database" + std::string(8192, 'Z');
+    db_->Close();  // the last connection folds its write-ahead log into the file as it closes
     WriteFile(path_, garbage);
     ASSERT_TRUE(db_->Open());  // SQLite reads the header lazily
     EXPECT_FALSE(db_->ExecuteSql("create table t(a INTEGER)"));
@@ -326,6 +356,38 @@ TEST_F(HostileFileTest, FullDiskFailuresAreLoggedOnceAndCounted) {
     EXPECT_EQ(Column(path_, "select count(*) from event_info"), Texts{"2"});
 }
 
+// A statement that fails inside a shared transaction (a write refused once) costs its own event
+// only: the events before it in the transaction and after it are committed, whether or not SQLite
+// rolled the transaction back.
+TEST_F(HostileFileTest, FailedEventInASharedTransactionCostsOnlyItself) {
+    ASSERT_TRUE(Init());
+    sp<EventDatabase> db = EventDatabase::getInstance();
+    auto event = [&](int n, const std::string& tag) {
+        db->BeginEvent();
+        Store(n, tag);
+        EXPECT_FALSE(db->EndEvent());
+    };
+    for (int round = 0; round < 2; round++) {
+        // Large parameter texts spill the small page cache, so the batch writes before its commit.
+        event(20, "before" + std::to_string(round) + std::string(2000, 'b'));
+        FaultyVfs::failWrites = 1;
+        event(1, "failed" + std::to_string(round) + std::string(8000, 'f'));
+        FaultyVfs::Heal();
+        event(1, "after" + std::to_string(round));
+        db->Commit();
+        EXPECT_FALSE(db->HasOpenBatch());
+        EXPECT_EQ(Column(path_, "select count(*) from event_info where param_list like 'before" +
+                                        std::to_string(round) + "%'"),
+                  Texts{"20"});
+        EXPECT_EQ(Column(path_,
+                         "select count(*) from event_info where param_list like 'after" + std::to_string(round) + "%'"),
+                  Texts{"1"});
+    }
+    EXPECT_EQ(Stat("storage.events.lost"), 0u);
+    EXPECT_GE(Stat("storage.db.errors"), 2u);
+    EXPECT_EQ(Column(path_, "PRAGMA integrity_check"), Texts{"ok"});
+}
+
 // Only the thread that holds the event database may use it; Close hands it over.
 TEST_F(HostileFileTest, DatabaseBelongsToOneThreadAtATime) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
@@ -348,7 +410,7 @@ TEST_F(SqlFileTest, ReadOnlyOrFullDiskLosesNoCommittedRow) {
     ASSERT_TRUE(db_->Open());
     EXPECT_FALSE(Insert("x"));
     EXPECT_NE(db_->GetLastError().find("readonly"), std::string::npos) << db_->GetLastError();
-    EXPECT_FALSE(db_->TruncateTable("raw_events"));
+    EXPECT_FALSE(db_->ExecuteSql("delete from raw_events"));
     ExpectIntact(10);
     // Each insert writes journal and database pages; the budget runs out within a few rows, sometimes
     // in the middle of a commit.

@@ -5,6 +5,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <cstdio>
+#include <memory>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -60,6 +63,19 @@ protected:
                 std::chrono::seconds(30));
     }
     std::string Log() { return ReadFile(root_.File("orvane.log")); }
+    // A counter of the running daemon, read as an operator would (0 when it does not answer).
+    uint64_t Counter(const std::string& name) {
+        std::string command =
+                ORVANE_BINARY_DIR "/orvanectl --workdir " + root_.File("work") + " dump stats 2>/dev/null";
+        std::unique_ptr<FILE, int (*)(FILE*)> out(popen(command.c_str(), "r"), pclose);
+        char line[256];
+        char found[128];
+        unsigned long long value = 0;
+        while (out != nullptr && fgets(line, sizeof(line), out.get()) != nullptr)
+            if (sscanf(line, "%127s %llu", found, &value) == 2 && name == found)
+                return value;
+        return 0;
+    }
 
     DevSim devsim_;
     TempDir root_;
@@ -85,6 +101,38 @@ TEST_F(StorageDaemonTest, ReaderHoldingATransactionCostsNoEvent) {
     sqlite3_exec(reader, "COMMIT", nullptr, nullptr, nullptr);
     sqlite3_close(reader);
     EXPECT_TRUE(WaitStored("event_id between 903001000 and 903001019", 20)) << Log();
+}
+
+// Killed while records pour in, the daemon keeps every event whose commit it reported, in a file
+// that is intact.
+TEST_F(StorageDaemonTest, KillUnderLoadKeepsEveryReportedCommit) {
+    uint64_t now = TimeUtil::GetTimestampSecond();
+    StartDaemon();
+    std::atomic<bool> stop{false};
+    std::atomic<uint32_t> sent{0};
+    std::thread writer([&] {
+        for (uint32_t i = 0; !stop && i < 200000; i++, sent++)
+            devsim_.Inject("qxev", "EventId " + std::to_string(903200000 + i) + " -t " + std::to_string(now) +
+                                           " -paraList {\"load\":" + std::to_string(i) + "}");
+    });
+    uint64_t committed = 0;
+    EXPECT_TRUE(WaitUntil([&] { return (committed = Counter("storage.events.committed")) >= 2000; },
+                          std::chrono::seconds(60)))
+            << committed << " committed\n"
+            << Log();
+    ASSERT_EQ(kill(daemon_, SIGKILL), 0);
+    waitpid(daemon_, nullptr, 0);
+    daemon_ = -1;
+    // Without its reader the node holds the writer; gone, it lets it go.
+    stop = true;
+    devsim_.Stop();
+    writer.join();
+    EXPECT_LT(committed, sent.load()) << "the kill came after the load";
+    EXPECT_EQ(Column(db_, "PRAGMA integrity_check"), Texts{"ok"});
+    // Each record is an event of its own id, which gets its counter row whether it is stored or dropped.
+    Texts stored = Column(db_, "select count(*) from event_daily where event_id between 903200000 and 903399999");
+    ASSERT_EQ(stored.size(), 1u);
+    EXPECT_GE(std::stoull(stored[0]), committed);
 }
 
 }  // namespace

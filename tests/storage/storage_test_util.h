@@ -50,22 +50,23 @@ inline std::string DumpOf(const std::function<void(int)>& dump) {
     return out;
 }
 
-// Runs SQL on a connection of its own, outside the code under test: the values of the first
-// column. It waits for the locks of other connections like any reader that means no harm.
-inline Texts Column(const std::string& path, const std::string& sql) {
+// Runs SQL on a connection of its own, outside the code under test: the values of one column
+// (the first by default). It waits for the locks of other connections like any reader that means no harm.
+inline Texts Column(const std::string& path, const std::string& sql, int column = 0) {
     sqlite3* db = nullptr;
-    Texts values;
+    std::pair<Texts, int> values{{}, column};
     EXPECT_EQ(sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr), SQLITE_OK) << path;
     sqlite3_busy_timeout(db, 20000);
     auto append = [](void* out, int, char** row, char**) {
-        static_cast<Texts*>(out)->push_back(row[0] != nullptr ? row[0] : "");
+        auto& [texts, at] = *static_cast<std::pair<Texts, int>*>(out);
+        texts.push_back(row[at] != nullptr ? row[at] : "");
         return 0;
     };
     char* error = nullptr;
     EXPECT_EQ(sqlite3_exec(db, sql.c_str(), append, &values, &error), SQLITE_OK) << sql << ": " << error;
     sqlite3_free(error);
     sqlite3_close(db);
-    return values;
+    return values.first;
 }
 
 // Bytes of the pages that hold data, as a vacuum would leave them.

@@ -1,82 +1,122 @@
 // orvane-loadgen: drives a running daemon through its kernel event device and measures what
-// it sustains end to end, from the write on the node to the commit in its event database, and
-// how much memory it takes under a flood.
-// Commits are observed, not queried: the database runs in rollback-journal mode, so each commit
-// deletes "event.db-journal" in the work folder, and inotify reports that without taking a lock
-// the daemon would have to wait for.
+// it sustains end to end, from the write on the node to the commit in its event database, what
+// that costs in disk writes and memory, and how much memory it takes under a flood.
+// Progress is read from the daemon's own statistics (the "stats" dump over its service socket):
+// the events its storage has handled (stored or dropped) and the events whose commit returned.
 #include <errno.h>
 #include <fcntl.h>
-#include <poll.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/inotify.h>
+#include <sys/mman.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cinttypes>
+#include <map>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include <android-base/file.h>
 #include <android-base/unique_fd.h>
+
+#include "host/service/host_binder_server.h"
 
 namespace {
 
+using android::String16;
 using android::base::unique_fd;
+using android::Orvane::IBinder;
+using android::Orvane::Parcel;
 using Clock = std::chrono::steady_clock;
 
 double Seconds(Clock::duration span) {
     return std::chrono::duration<double>(span).count();
 }
 
-// Counts the daemon's commits as they happen.
-class CommitWatch {
+// The daemon's counters, read through its dump transaction.
+class DaemonCounters {
 public:
-    bool Open(const std::string& workDir) {
-        fd_.reset(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
-        return fd_.ok() && inotify_add_watch(fd_.get(), workDir.c_str(), IN_DELETE) >= 0;
-    }
-    // Waits up to `timeoutMs` for commits; returns how many arrived (0 on time-out).
-    int Wait(int timeoutMs) {
-        struct pollfd watch = {fd_.get(), POLLIN, 0};
-        if (poll(&watch, 1, timeoutMs) <= 0) {
-            return 0;
+    explicit DaemonCounters(const std::string& workDir) : socket_(workDir + "/orvane.sock") {}
+
+    // Reads them again; false when the daemon did not answer.
+    bool Read() {
+        unique_fd out(memfd_create("orvane-stats", MFD_CLOEXEC));
+        android::Orvane::HostBinderClient client;
+        if (!out.ok() || !client.Connect(socket_)) {
+            return false;
         }
-        return Drain();
-    }
-    // Takes the commits already reported without waiting.
-    int Drain() {
-        alignas(inotify_event) char buffer[4096];
-        int commits = 0;
-        ssize_t length;
-        while ((length = read(fd_.get(), buffer, sizeof(buffer))) > 0) {
-            for (char* at = buffer; at < buffer + length;) {
-                auto* event = reinterpret_cast<inotify_event*>(at);
-                if (event->len > 0 && strcmp(event->name, "event.db-journal") == 0) {
-                    ++commits;
-                }
-                at += sizeof(inotify_event) + event->len;
+        Parcel data;
+        Parcel reply;
+        data.writeFileDescriptor(out.get());
+        data.writeInt32(1);
+        data.writeString16(String16("stats"));
+        if (client.Transact(IBinder::DUMP_TRANSACTION, data, &reply) != android::OK) {
+            return false;
+        }
+        std::string text;
+        lseek(out.get(), 0, SEEK_SET);
+        android::base::ReadFdToString(out.get(), &text);
+        values_.clear();
+        char name[128];
+        unsigned long long value = 0;
+        for (const char* line = text.c_str(); *line != '\0';) {
+            if (sscanf(line, "%127s %llu", name, &value) == 2) {
+                values_[name] = value;
             }
+            const char* next = strchr(line, '\n');
+            line = next == nullptr ? line + strlen(line) : next + 1;
         }
-        if (commits > 0) {
-            lastCommit = Clock::now();
-        }
-        return commits;
+        return true;
     }
-    Clock::time_point lastCommit;
+    uint64_t Get(const std::string& name) const {
+        auto it = values_.find(name);
+        return it == values_.end() ? 0 : it->second;
+    }
+    bool Has(const std::string& name) const { return values_.count(name) != 0; }
+    // Fault events the storage has decided on: stored, failed or dropped.
+    uint64_t Handled() const {
+        return Get("storage.events.stored") + Get("storage.events.store_failed") +
+               Get("storage.events.dropped.over_daily_quota") + Get("storage.events.dropped.punished");
+    }
+    // Events whose commit has returned. A daemon that commits each statement on its own has no
+    // such counter: what it stored is committed.
+    uint64_t Committed() const { return Has("storage.events.committed") ? Get("storage.events.committed") : Handled(); }
+    uint64_t Commits() const { return Get("storage.db.commits"); }
 
 private:
-    unique_fd fd_;
+    std::string socket_;
+    std::map<std::string, uint64_t> values_;
 };
 
 struct ProcessUsage {
     double cpuSeconds = 0;
-    long peakRssKb = 0;  // VmHWM
-    long rssKb = 0;      // VmRSS
+    long peakRssKb = 0;       // VmHWM
+    long rssKb = 0;           // VmRSS
+    long pssKb = 0;           // smaps_rollup Pss
+    long privateDirtyKb = 0;  // smaps_rollup Private_Dirty
+    uint64_t writeBytes = 0;  // io write_bytes: what reached the storage layer
+    uint64_t writeCalls = 0;  // io syscw
 };
+
+// Scans `path` for "key value" lines with the given formats.
+void ScanLines(const std::string& path, const std::vector<std::pair<const char*, void*>>& formats) {
+    FILE* file = fopen(path.c_str(), "r");
+    if (file == nullptr) {
+        return;
+    }
+    char line[256];
+    while (fgets(line, sizeof(line), file) != nullptr) {
+        for (const auto& [format, out] : formats) {
+            sscanf(line, format, out);
+        }
+    }
+    fclose(file);
+}
 
 ProcessUsage ReadUsage(pid_t pid) {
     ProcessUsage usage;
@@ -89,16 +129,23 @@ ProcessUsage ReadUsage(pid_t pid) {
         }
         fclose(stat);
     }
-    if (FILE* status = fopen((proc + "/status").c_str(), "r")) {
-        char line[256];
-        while (fgets(line, sizeof(line), status) != nullptr) {
-            sscanf(line, "VmHWM: %ld kB", &usage.peakRssKb);
-            sscanf(line, "VmRSS: %ld kB", &usage.rssKb);
-        }
-        fclose(status);
-    }
+    ScanLines(proc + "/status", {{"VmHWM: %ld kB", &usage.peakRssKb}, {"VmRSS: %ld kB", &usage.rssKb}});
+    ScanLines(proc + "/smaps_rollup",
+              {{"Pss: %ld kB", &usage.pssKb}, {"Private_Dirty: %ld kB", &usage.privateDirtyKb}});
+    ScanLines(proc + "/io", {{"write_bytes: %" SCNu64, &usage.writeBytes}, {"syscw: %" SCNu64, &usage.writeCalls}});
     return usage;
 }
+
+// The largest PSS and private dirty memory seen while a phase runs.
+struct MemoryPeak {
+    void Sample(pid_t pid) {
+        ProcessUsage now = ReadUsage(pid);
+        pssKb = std::max(pssKb, now.pssKb);
+        privateDirtyKb = std::max(privateDirtyKb, now.privateDirtyKb);
+    }
+    long pssKb = 0;
+    long privateDirtyKb = 0;
+};
 
 bool WriteRecord(int fd, uint32_t id, const char* params) {
     std::string record =
@@ -106,14 +153,36 @@ bool WriteRecord(int fd, uint32_t id, const char* params) {
     return write(fd, record.data(), record.size()) == static_cast<ssize_t>(record.size());
 }
 
-// Writes records of `ids` distinct ids, round robin, as fast as the daemon stores them, for
+// Polls the counters until `done` holds or `timeout` passes without progress of `progress`.
+template <typename Done, typename Progress>
+bool PollUntil(DaemonCounters& counters, Done done, Progress progress, Clock::duration timeout,
+               Clock::duration period) {
+    Clock::time_point lastChange = Clock::now();
+    uint64_t last = 0;
+    while (counters.Read() || Clock::now() - lastChange < timeout) {
+        if (done()) {
+            return true;
+        }
+        uint64_t now = progress();
+        if (now != last) {
+            last = now;
+            lastChange = Clock::now();
+        } else if (Clock::now() - lastChange >= timeout) {
+            return false;
+        }
+        std::this_thread::sleep_for(period);
+    }
+    return false;
+}
+
+// Writes records of `ids` distinct ids, round robin, as fast as the daemon handles them, for
 // `seconds`, then waits until it has committed everything. The daemon queues what it reads
-// without bound, so the writer holds back once it is more than kMaxBacklog events ahead of the
-// commits; commits per event are learnt from a warm-up burst first.
-int Throughput(int node, CommitWatch& commits, pid_t pid, uint32_t ids, double seconds) {
+// without bound, so the writer holds back once it is more than kMaxBacklog events ahead.
+int Throughput(int node, DaemonCounters& counters, pid_t pid, uint32_t ids, double seconds) {
     constexpr uint32_t kFirstId = 903000000;
     constexpr uint64_t kWarmUp = 2000;
-    constexpr double kMaxBacklog = 2000;
+    constexpr uint64_t kMaxBacklog = 2000;
+    constexpr auto kPoll = std::chrono::milliseconds(20);
     uint64_t written = 0;
     auto writeNext = [&] {
         if (!WriteRecord(node, kFirstId + static_cast<uint32_t>(written % ids), "{\"load\":1}")) {
@@ -122,68 +191,72 @@ int Throughput(int node, CommitWatch& commits, pid_t pid, uint32_t ids, double s
         }
         ++written;
     };
-    commits.Drain();
+    if (!counters.Read()) {
+        fprintf(stderr, "orvane-loadgen: the daemon does not answer on its socket\n");
+        return 1;
+    }
+    uint64_t handledBase = counters.Handled();
+    auto handled = [&] { return counters.Handled() - handledBase; };
+    auto settled = [&] { return handled() >= written && counters.Committed() >= counters.Handled(); };
     while (written < kWarmUp) {
         writeNext();
     }
-    uint64_t warmUpCommits = 0;
-    for (int arrived; (arrived = commits.Wait(2000)) > 0;) {
-        warmUpCommits += arrived;
-    }
-    double perEvent = std::max(1.0, static_cast<double>(warmUpCommits) / kWarmUp);
+    PollUntil(counters, settled, handled, std::chrono::seconds(5), kPoll);
 
     ProcessUsage before = ReadUsage(pid);
+    uint64_t commitsBefore = counters.Commits();
+    uint64_t storedBefore = counters.Get("storage.events.stored");
+    MemoryPeak memory;
     Clock::time_point start = Clock::now();
+    Clock::time_point lastPoll = start;
     uint64_t first = written;
-    // The backlog is estimated from the commits since `counted`; a daemon gone quiet has
-    // caught up, which corrects the estimate when the mix of commits per event shifts.
-    uint64_t counted = written;
-    uint64_t committed = 0;
+    uint64_t seenHandled = handled();
     while (Seconds(Clock::now() - start) < seconds) {
-        double backlog = static_cast<double>(written - counted) - committed / perEvent;
-        if (backlog > kMaxBacklog) {
-            int arrived = commits.Wait(200);
-            committed += arrived;
-            if (arrived == 0) {
-                counted = written;
-                committed = 0;
+        if (written - seenHandled > kMaxBacklog || Clock::now() - lastPoll >= kPoll) {
+            counters.Read();
+            memory.Sample(pid);
+            seenHandled = handled();
+            lastPoll = Clock::now();
+            if (written - seenHandled > kMaxBacklog) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(2));
             }
             continue;
         }
         writeNext();
-        if (written % 64 == 0) {
-            committed += commits.Drain();
-        }
     }
     double writeSeconds = Seconds(Clock::now() - start);
-    // Drained once no commit has come for two seconds.
-    while (commits.Wait(2000) > 0) {
-    }
-    double totalSeconds = Seconds(commits.lastCommit - start);
+    bool drained = PollUntil(counters, settled, handled, std::chrono::seconds(5), std::chrono::milliseconds(2));
+    double totalSeconds = Seconds(Clock::now() - start);
+    memory.Sample(pid);
     ProcessUsage after = ReadUsage(pid);
     uint64_t events = written - first;
-    printf("ids=%u events=%llu commits_per_event=%.2f write_s=%.1f drained_s=%.1f end_to_end_per_s=%.0f "
-           "daemon_cpu_us_per_event=%.1f daemon_peak_rss_kb=%ld written=%llu\n",
-           ids, static_cast<unsigned long long>(events), perEvent, writeSeconds, totalSeconds, events / totalSeconds,
-           (after.cpuSeconds - before.cpuSeconds) * 1e6 / events, after.peakRssKb,
-           static_cast<unsigned long long>(written));
-    return 0;
+    uint64_t stored = counters.Get("storage.events.stored") - storedBefore;
+    uint64_t diskBytes = after.writeBytes - before.writeBytes;
+    std::string commits = "n/a";
+    if (counters.Has("storage.db.commits")) {
+        char text[32];
+        snprintf(text, sizeof(text), "%.3f", static_cast<double>(counters.Commits() - commitsBefore) / events);
+        commits = text;
+    }
+    printf("ids=%u events=%llu stored=%llu write_s=%.1f drained_s=%.1f end_to_end_per_s=%.0f stored_per_s=%.0f "
+           "commits_per_event=%s disk_bytes_per_event=%.0f disk_bytes_per_stored=%.0f write_calls_per_event=%.2f "
+           "daemon_cpu_us_per_event=%.1f pss_kb=%ld private_dirty_kb=%ld daemon_peak_rss_kb=%ld written=%llu%s\n",
+           ids, static_cast<unsigned long long>(events), static_cast<unsigned long long>(stored), writeSeconds,
+           totalSeconds, events / totalSeconds, stored / totalSeconds, commits.c_str(),
+           static_cast<double>(diskBytes) / events, stored > 0 ? static_cast<double>(diskBytes) / stored : 0.0,
+           static_cast<double>(after.writeCalls - before.writeCalls) / events,
+           (after.cpuSeconds - before.cpuSeconds) * 1e6 / events, memory.pssKb, memory.privateDirtyKb, after.peakRssKb,
+           static_cast<unsigned long long>(written), drained ? "" : " NOT_DRAINED");
+    return drained ? 0 : 1;
 }
 
 // Writes `rate` records a second, each of a new id so that each is stored, and times each from
-// its write to the last commit it causes.
-int Latency(int node, CommitWatch& commits, double rate, double seconds) {
+// its write until the daemon reports its commit.
+int Latency(int node, DaemonCounters& counters, double rate, double seconds) {
     constexpr uint32_t kFirstId = 904000000;
-    constexpr int kTimeoutMs = 2000;
-    // How many commits one stored event makes, from the first one on a quiet daemon.
-    commits.Drain();
-    WriteRecord(node, kFirstId, "{\"latency\":1}");
-    int perEvent = 0;
-    for (int arrived; (arrived = commits.Wait(500)) > 0;) {
-        perEvent += arrived;
-    }
-    if (perEvent == 0) {
-        fprintf(stderr, "orvane-loadgen: no commit seen for a stored event\n");
+    constexpr auto kTimeout = std::chrono::seconds(2);
+    if (!counters.Read()) {
+        fprintf(stderr, "orvane-loadgen: the daemon does not answer on its socket\n");
         return 1;
     }
     auto period = std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(1.0 / rate));
@@ -194,24 +267,19 @@ int Latency(int node, CommitWatch& commits, double rate, double seconds) {
     for (uint32_t i = 1; i <= count; ++i) {
         std::this_thread::sleep_until(due);
         due += period;
+        counters.Read();
+        uint64_t target = counters.Committed() + 1;
         Clock::time_point written = Clock::now();
         WriteRecord(node, kFirstId + i, "{\"latency\":1}");
-        int seen = 0;
-        while (seen < perEvent) {
-            int arrived = commits.Wait(kTimeoutMs);
-            if (arrived == 0) {
-                break;
-            }
-            seen += arrived;
+        bool seen = false;
+        while (!seen && Clock::now() - written < kTimeout) {
+            seen = counters.Read() && counters.Committed() >= target;
         }
-        if (seen < perEvent) {
+        if (!seen) {
             ++missed;
             continue;
         }
-        latencies.push_back(Seconds(commits.lastCommit - written) * 1e3);
-    }
-    // Late commits of missed events must land before the daemon is stopped.
-    while (commits.Wait(2000) > 0) {
+        latencies.push_back(Seconds(Clock::now() - written) * 1e3);
     }
     if (latencies.empty()) {
         fprintf(stderr, "orvane-loadgen: no event was committed in time\n");
@@ -219,9 +287,8 @@ int Latency(int node, CommitWatch& commits, double rate, double seconds) {
     }
     std::sort(latencies.begin(), latencies.end());
     auto at = [&](double share) { return latencies[std::min(latencies.size() - 1, size_t(share * latencies.size()))]; };
-    printf("rate_per_s=%.0f events=%zu commits_per_event=%d median_ms=%.2f p99_ms=%.2f max_ms=%.2f missed=%u "
-           "written=%u\n",
-           rate, latencies.size(), perEvent, at(0.5), at(0.99), latencies.back(), missed, count + 1);
+    printf("rate_per_s=%.0f events=%zu median_ms=%.2f p99_ms=%.2f max_ms=%.2f missed=%u written=%u\n", rate,
+           latencies.size(), at(0.5), at(0.99), latencies.back(), missed, count);
     return 0;
 }
 
@@ -238,6 +305,14 @@ int Flood(const char* node, pid_t pid, uint32_t ids, uint64_t records, size_t by
     }
     std::atomic<uint64_t> next{0};
     std::atomic<bool> failed{false};
+    std::atomic<bool> settled{false};
+    MemoryPeak memory;
+    std::thread sampler([&] {
+        while (!settled) {
+            memory.Sample(pid);
+            std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        }
+    });
     Clock::time_point start = Clock::now();
     std::vector<std::thread> threads;
     for (int w = 0; w < writers; ++w) {
@@ -266,12 +341,14 @@ int Flood(const char* node, pid_t pid, uint32_t ids, uint64_t records, size_t by
         cpu = ReadUsage(pid).cpuSeconds;
         std::this_thread::sleep_for(std::chrono::seconds(1));
     }
+    settled = true;
+    sampler.join();
     double settleSeconds = Seconds(Clock::now() - start);
     ProcessUsage after = ReadUsage(pid);
     printf("records=%llu bytes_per_record=%zu writers=%d write_s=%.1f settled_s=%.1f rss_before_kb=%ld "
-           "peak_rss_kb=%ld rss_after_kb=%ld\n",
+           "peak_rss_kb=%ld rss_after_kb=%ld peak_pss_kb=%ld peak_private_dirty_kb=%ld\n",
            static_cast<unsigned long long>(std::min<uint64_t>(next, records)), bytes, writers, writeSeconds,
-           settleSeconds, before.rssKb, after.peakRssKb, after.rssKb);
+           settleSeconds, before.rssKb, after.peakRssKb, after.rssKb, memory.pssKb, memory.privateDirtyKb);
     return failed ? 1 : 0;
 }
 
@@ -302,12 +379,8 @@ int main(int argc, char** argv) {
         fprintf(stderr, "orvane-loadgen: cannot open %s: %s\n", argv[2], strerror(errno));
         return 1;
     }
-    CommitWatch commits;
-    if (!commits.Open(argv[3])) {
-        fprintf(stderr, "orvane-loadgen: cannot watch %s: %s\n", argv[3], strerror(errno));
-        return 1;
-    }
-    return throughput ? Throughput(node.get(), commits, atoi(argv[4]),
+    DaemonCounters counters(argv[3]);
+    return throughput ? Throughput(node.get(), counters, atoi(argv[4]),
                                    static_cast<uint32_t>(std::max(1, atoi(argv[5]))), atof(argv[6]))
-                      : Latency(node.get(), commits, atof(argv[4]), atof(argv[5]));
+                      : Latency(node.get(), counters, atof(argv[4]), atof(argv[5]));
 }
