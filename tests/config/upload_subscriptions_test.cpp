@@ -4,6 +4,7 @@
 
 #include "config/event_upload_xml_parser.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "tests/storage/storage_test_util.h"
 
 namespace android::Orvane {
@@ -58,7 +59,7 @@ TEST(UploadSubscriptionsTest, SmallestRangeWinsAndBadEntriesAreLeftOut) {
 }
 
 TEST(UploadSubscriptionsTest, ShippedRulesSubscribe) {
-    auto rules = EventUploadXmlParser::ReadRules(std::string(ORVANE_SOURCE_DIR) + "/etc/event_upload.xml", nullptr);
+    auto rules = EventUploadXmlParser::ReadRules(TestDataDir() + "/etc/event_upload.xml", nullptr);
     EXPECT_EQ(rules->rejected, 0u);
     ASSERT_NE(rules->FindSubscription(901001001), nullptr);
     EXPECT_EQ(rules->FindSubscription(901001001)->expireDays, 90u);

@@ -15,6 +15,7 @@
 #include "tests/common/envelope_opener.h"
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 #include "utils/sys_env.h"
@@ -28,7 +29,7 @@ constexpr char kSerial[] = "ZX1G22TEST0042";
 class EventInfoPackTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        const std::string etc = std::string(ORVANE_SOURCE_DIR) + "/etc/";
+        const std::string etc = TestDataDir() + "/etc/";
         ASSERT_TRUE(FileUtil::CreateDirectory(configDir_, 0775));
         ASSERT_TRUE(FileUtil::CreateDirectory(workDir_, 0775));
         for (const char* name : {"privacy_policy.xml", "privacy_server_key.pem"}) {
@@ -139,8 +140,7 @@ TEST_F(EventInfoPackTest, SubscribedEventsLeaveSealedRecordsInRotatingFiles) {
     EXPECT_EQ(record["buildType"].asInt(), DevInfo::GetBuildType());
     EXPECT_EQ(ReadFile(workDir_ + "eventinfo.901").find(kSerial), std::string::npos);
     std::string serial;
-    EnvelopeOpener server(
-            ReadFile(std::string(ORVANE_SOURCE_DIR) + "/tests/common/privacy_test_server_private_key.pem"));
+    EnvelopeOpener server(ReadFile(TestDataDir() + "/tests/common/privacy_test_server_private_key.pem"));
     ASSERT_TRUE(server.Open(record["serialNo"].asString(), serial));
     EXPECT_EQ(serial, kSerial);
 

@@ -12,6 +12,7 @@
 #include "storage/event_database.h"
 #include "tests/common/envelope_opener.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/test_data.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
 #include "utils/file_util.h"
@@ -31,7 +32,7 @@ ORVANE_REGISTER_PLUGIN(EventInfoTestSource);
 
 TEST(EventInfoPlatformTest, SubscribedEventsAreStoredRecordedAndHandedOver) {
     TempDir root;
-    const std::string etc = std::string(ORVANE_SOURCE_DIR) + "/etc/";
+    const std::string etc = TestDataDir() + "/etc/";
     for (const char* name : {"event.xml", "event_quota.xml", "privacy_policy.xml", "privacy_server_key.pem"}) {
         WriteFile(root.File(name), ReadFile(etc + name));
     }
@@ -95,8 +96,7 @@ TEST(EventInfoPlatformTest, SubscribedEventsAreStoredRecordedAndHandedOver) {
     EXPECT_EQ(records[0]["zipLogName"].asString(), "NO_LOG_CONFIG");
     EXPECT_EQ(records[0]["expire"].asUInt(), 90u);
     std::string serial;
-    EnvelopeOpener server(
-            ReadFile(std::string(ORVANE_SOURCE_DIR) + "/tests/common/privacy_test_server_private_key.pem"));
+    EnvelopeOpener server(ReadFile(TestDataDir() + "/tests/common/privacy_test_server_private_key.pem"));
     ASSERT_TRUE(server.Open(records[3]["serialNo"].asString(), serial));
     EXPECT_EQ(serial, "PLATFORM0SERIAL");
 
