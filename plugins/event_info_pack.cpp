@@ -37,20 +37,19 @@ constexpr char kKeyZipLogName[] = "zipLogName";
 constexpr char kKeyMarked[] = "EventInfoPack.marked";
 // "zipLogName" of a subscribed event that no one packed logs for and gave no reason.
 constexpr char kNoPack[] = "NO_LOG_PACK";
-constexpr char kFilePattern[] = "eventinfo\\.9\\d{2}(\\.0)*";
 constexpr mode_t kFileMode = 0660;
 constexpr uint32_t kDomainDivisor = 1000000;
 
 // The "eventinfo" files of the work folder: name to its domain.
 std::map<std::string, uint32_t> ListFiles(const std::string& workDir) {
-    static const std::unique_ptr<FilePattern> pattern = FilePattern::Compile(kFilePattern, nullptr);
+    static const std::unique_ptr<FilePattern> kNames = FilePattern::Compile(EventInfoPack::kFilePattern, nullptr);
     std::map<std::string, uint32_t> files;
     std::unique_ptr<DIR, int (*)(DIR*)> dir(opendir(workDir.c_str()), closedir);
     if (dir == nullptr) {
         return files;
     }
     while (struct dirent* entry = readdir(dir.get())) {
-        if (pattern->Matches(entry->d_name)) {
+        if (kNames->Matches(entry->d_name)) {
             files[entry->d_name] =
                     static_cast<uint32_t>(strtoul(entry->d_name + strlen(EventInfoPack::kFilePrefix), nullptr, 10));
         }

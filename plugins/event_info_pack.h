@@ -37,6 +37,8 @@ class EventInfoPack : public Plugin {
 public:
     static constexpr char kFaultPipeline[] = "dftFaultEvent";
     static constexpr char kFilePrefix[] = "eventinfo.";
+    // The names of the record files, open and closed, which "pack-log" hands over.
+    static constexpr char kFilePattern[] = "eventinfo\\.9\\d{2}(\\.0)*";
     static constexpr off_t kRotateSize = 64 * 1024;
     static constexpr uint32_t kMinKeepDays = 30;
     static constexpr unsigned long kCleanUpPeriodSec = 24 * 60 * 60;

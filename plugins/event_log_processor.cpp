@@ -26,6 +26,7 @@
 #include "platform/plugin_context.h"
 #include "platform/plugin_factory.h"
 #include "plugins/cmd_processor.h"
+#include "plugins/event_info_pack.h"
 #include "utils/dev_info.h"
 #include "utils/file_util.h"
 #include "utils/orvane_log.h"
@@ -781,7 +782,7 @@ std::vector<std::string> EventLogProcessor::ListDomainFolders(const std::string&
 }
 
 std::vector<std::string> EventLogProcessor::ListEventInfoFiles() {
-    return GetFileInDirByPattern(workDir_, "eventinfo\\.9\\d{2}(\\.0)*", -1);
+    return GetFileInDirByPattern(workDir_, EventInfoPack::kFilePattern, -1);
 }
 
 std::vector<std::string> EventLogProcessor::GetFileInDirByPattern(const std::string& dir, const std::string& pattern,
