@@ -142,6 +142,7 @@ write_log_rules() {
         printf 'pid: 42%s, name: com.android.phone\nsignal 11 (SIGSEGV)\n' "$n" > "$LOGS/tombstones/tombstone_$n"
     done
     echo "ssid=home psk=secret" > "$SANDBOX/private/wifi_passwords.txt"
+    # Host paths for the rules; the subscriptions are the shipped ones.
     cat > "$SANDBOX/cloud/event_upload.xml" << EOF
 <EventUpload>
   <LogRule eventMin="901000000" eventMax="901999999">
@@ -166,10 +167,13 @@ write_log_rules() {
     <Static path="/proc/loadavg"/>
     <Static path="/proc/meminfo"/>
   </LogRule>
+$(grep '<Subscribe ' "$ROOT/etc/event_upload.xml")
 </EventUpload>
 EOF
     sed "s|<LogPaths>|<LogPaths><Allow prefix=\"$LOGS/\"/><Allow prefix=\"$WORK/\"/>|" \
         "$ROOT/etc/privacy_policy.xml" > "$SANDBOX/cloud/privacy_policy.xml"
+    # A policy's key file lies beside it.
+    cp "$ROOT/etc/privacy_server_key.pem" "$SANDBOX/cloud/"
 }
 
 section "sandbox $SANDBOX"
