@@ -31,8 +31,6 @@ ORVANE_REGISTER_PLUGIN(EventInfoPack);
 
 namespace {
 
-constexpr char kKeySubscribe[] = "subscribe";
-constexpr char kKeyZipLogName[] = "zipLogName";
 // Set (as an extra value) by the pipeline step, so the listener call knows it is the second one.
 constexpr char kKeyMarked[] = "EventInfoPack.marked";
 // "zipLogName" of a subscribed event that no one packed logs for and gave no reason.

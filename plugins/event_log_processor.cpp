@@ -56,7 +56,6 @@ constexpr uint64_t kMonthSeconds = 2592000;
 constexpr uint64_t kYearSeconds = 31536000;
 constexpr size_t kPackSecondsKept = 256;
 
-constexpr char kKeyZipLogName[] = "zipLogName";
 constexpr char kKeyLogZipName[] = "EVENT_LOG_ZIP_NAME";
 constexpr char kUeOff[] = "ue_off";
 constexpr char kUploading[] = "uploading";
