@@ -98,14 +98,18 @@ LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
 
 uint64_t EventLoop::Enqueue(LoopEvent entry) {
     uint64_t id = entry.createTime;
+    bool wake = false;
     {
         Mutex::Autolock lock(mutex_);
         if (stopped_ && entry.taskType == 1) {
             return id;  // `entry` is released after the lock, which releases its caller
         }
         PushLocked(std::move(entry));
+        wake = sleeping_;
     }
-    looper_->wake();
+    if (wake) {
+        looper_->wake();
+    }
     return id;
 }
 
@@ -168,6 +172,7 @@ void EventLoop::ProcessEventLoop() {
         if (self != nullptr) {
             Mutex::Autolock lock(mutex_);
             pending = !queue_.empty();
+            sleeping_ = !pending;
         }
         while (pending) {
             LoopEvent entry;
@@ -187,6 +192,7 @@ void EventLoop::ProcessEventLoop() {
             Mutex::Autolock lock(mutex_);
             current_ = nullptr;
             pending = !queue_.empty();
+            sleeping_ = !pending;
         }
     }
     // An entry due beyond the longest sleep is looked at again after that sleep.
@@ -197,10 +203,12 @@ void EventLoop::ProcessEventLoop() {
 bool EventLoop::FetchNextEvent(unsigned long now, unsigned long& waitNs, LoopEvent& out) {
     Mutex::Autolock lock(mutex_);
     if (queue_.empty()) {
+        sleeping_ = true;
         return false;
     }
     if (queue_.front().targetTime > now) {
         waitNs = queue_.front().targetTime - now;
+        sleeping_ = true;
         return false;
     }
     std::pop_heap(queue_.begin(), queue_.end());

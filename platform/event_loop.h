@@ -54,8 +54,10 @@ public:
 //
 // Threads: any thread may add entries (AddEvent, AddEventWaitResult, AddTask); only the loop's
 // thread takes and runs them. `mutex_` guards the queue and is never held while an entry runs;
-// producers wake the looper after releasing it. StartLoop and StopLoop belong to the loop's
-// owner and must not race each other. Always hold a loop through sp<EventLoop>.
+// producers wake the looper after releasing it, and only when the loop may sleep: a loop still
+// running entries looks at the queue again before it sleeps, so waking it is a wasted syscall.
+// StartLoop and StopLoop belong to the loop's owner and must not race each other. Always hold a
+// loop through sp<EventLoop>.
 //
 // Given statistics, the loop reports the high-water mark of its backlog as
 // "loop.<name>.backlog_high" and counts the entries that ran 301 ms or more as "loop.<name>.slow".
@@ -87,7 +89,7 @@ public:
 
 private:
     LoopEvent NewEntry(unsigned long delaySeconds, bool repeat) const;
-    // Queues the entry and wakes the loop; a synchronous entry given to a stopped loop is dropped,
+    // Queues the entry and wakes the loop if it may sleep; a synchronous entry given to a stopped loop is dropped,
     // which releases its caller.
     uint64_t Enqueue(LoopEvent entry);
     void PushLocked(LoopEvent&& entry) REQUIRES(mutex_);
@@ -111,6 +113,8 @@ private:
     Mutex mutex_;
     LoopEvent* current_ GUARDED_BY(mutex_) = nullptr;
     std::deque<LoopEvent> queue_ GUARDED_BY(mutex_);
+    // From the loop's last look at the queue, when it found nothing due, until its next look.
+    bool sleeping_ GUARDED_BY(mutex_) = true;
     // Set by StopLoop: synchronous entries are refused from then on.
     bool stopped_ GUARDED_BY(mutex_) = false;
     // Kept for file-descriptor events; nothing registers any yet.

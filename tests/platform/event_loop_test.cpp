@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <fstream>
+#include <future>
 
 #include "tests/platform/platform_test_util.h"
 
@@ -162,6 +163,17 @@ TEST_F(EventLoopTest, BacklogAndItsHighWaterMarkAndSlowEntriesAreReported) {
     EXPECT_EQ(capture.Count(ANDROID_LOG_DEBUG, "ProcessEventLoop onevent name stats_loop  consume time 3"), 1u)
             << capture.Dump();
     loop->StopLoop();
+}
+
+TEST_F(EventLoopTest, EntryQueuedAsTheLoopFallsAsleepStillRuns) {
+    // Ping-pong: each entry is queued the moment the one before has run, that is while the loop
+    // decides whether to sleep; a wake lost there would leave the loop asleep for good.
+    for (int round = 0; round < 20000; round++) {
+        auto ran = std::make_shared<std::promise<void>>();
+        std::future<void> done = ran->get_future();
+        loop_->AddTask([ran] { ran->set_value(); });
+        ASSERT_EQ(done.wait_for(std::chrono::seconds(60)), std::future_status::ready) << "round " << round;
+    }
 }
 
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
