@@ -4,6 +4,7 @@
 // The database lives in $ORVANE_BENCH_DIR (default /tmp); put it on a tmpfs (/dev/shm) to
 // see the bookkeeping's own cost without the disk flushes.
 
+#include <fcntl.h>
 #include <sqlite3.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -14,6 +15,7 @@
 #include <fstream>
 #include <string>
 
+#include <android-base/unique_fd.h>
 #include <android/log.h>
 #include <benchmark/benchmark.h>
 
@@ -73,13 +75,26 @@ void Prefill(const std::string& dbPath, int64_t rows, uint64_t day) {
     sqlite3_close(db);
 }
 
+// Copies a file and flushes the copy, so that the first fsync of a timed commit does not also
+// write out the hundred megabytes the set-up has just copied.
+void CopyToDisk(const std::string& from, const std::string& to) {
+    {
+        std::ifstream in(from, std::ios::binary);
+        std::ofstream(to, std::ios::binary) << in.rdbuf();
+    }
+    base::unique_fd fd(open(to.c_str(), O_RDONLY | O_CLOEXEC));
+    if (fd.get() < 0 || fsync(fd.get()) != 0) {
+        fprintf(stderr, "cannot flush %s\n", to.c_str());
+        abort();
+    }
+}
+
 // A database made by the real code and prefilled with `rows` rows, in `folder`. A big prefill is
 // made once and kept under $ORVANE_BENCH_DIR, then copied: its day is the one stored in it.
 void MakeDatabase(const std::string& folder, int64_t rows) {
     std::string kept = BenchRoot() + "orvane_bench_grown_" + std::to_string(rows) + ".db";
     if (rows >= 100000 && FileUtil::FileExists(kept)) {
-        std::ifstream in(kept, std::ios::binary);
-        std::ofstream(folder + "event.db", std::ios::binary) << in.rdbuf();
+        CopyToDisk(kept, folder + "event.db");
         return;
     }
     FakePluginContext context(folder, folder);
@@ -89,8 +104,7 @@ void MakeDatabase(const std::string& folder, int64_t rows) {
     EventDatabase::getInstance()->Close();
     Prefill(folder + "event.db", rows, day);
     if (rows >= 100000) {
-        std::ifstream in(folder + "event.db", std::ios::binary);
-        std::ofstream(kept, std::ios::binary) << in.rdbuf();
+        CopyToDisk(folder + "event.db", kept);
     }
 }
 
