@@ -12,21 +12,15 @@
 #include <string>
 #include <string_view>
 
+#include "fuzz/event_keeper.h"
 #include "platform/pipeline.h"
 #include "plugins/event_radiator.h"
 
 using namespace android;
 using namespace android::Orvane;
+using namespace android::Orvane::FuzzEvents;
 
 namespace {
-
-struct KeepLast : Plugin {
-    EVENT_RET OnEvent(sp<Event>& event) override {
-        last = event;
-        return 0;
-    }
-    sp<Event> last;
-};
 
 // A decimal number as the scan conversions read it (optional sign), when it lies in [min, max].
 bool InRange(std::string_view text, int64_t min, int64_t max, int64_t& value) {
@@ -47,14 +41,9 @@ void Check(bool condition, const char* what) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    static KeepLast* keeper = [] {
-        KeepLast* created = new KeepLast();
-        created->incStrong(created);
-        return created;
-    }();
+    static KeepLast* keeper = HeldForRun(new KeepLast());
     static EventRadiator* radiator = [] {
-        EventRadiator* created = new EventRadiator();
-        created->incStrong(created);
+        EventRadiator* created = HeldForRun(new EventRadiator());
         created->AddPipeline("dftFaultEvent", new Pipeline("dftFaultEvent", {keeper}));
         return created;
     }();

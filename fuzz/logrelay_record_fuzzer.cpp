@@ -7,33 +7,18 @@
 #include <cstdlib>
 #include <string>
 
+#include "fuzz/event_keeper.h"
 #include "platform/pipeline.h"
 #include "plugins/event_logrelay_source.h"
 
 using namespace android;
 using namespace android::Orvane;
-
-namespace {
-
-struct KeepLast : Plugin {
-    EVENT_RET OnEvent(sp<Event>& event) override {
-        last = event;
-        return 0;
-    }
-    sp<Event> last;
-};
-
-}  // namespace
+using namespace android::Orvane::FuzzEvents;
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    static KeepLast* keeper = [] {
-        KeepLast* created = new KeepLast();
-        created->incStrong(created);
-        return created;
-    }();
+    static KeepLast* keeper = HeldForRun(new KeepLast());
     static EventLogrelaySource* relay = [] {
-        EventLogrelaySource* created = new EventLogrelaySource();
-        created->incStrong(created);
+        EventLogrelaySource* created = HeldForRun(new EventLogrelaySource());
         created->AddPipeline("dftFaultEvent", new Pipeline("dftFaultEvent", {keeper}));
         return created;
     }();
