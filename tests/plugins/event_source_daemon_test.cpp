@@ -1,22 +1,14 @@
 // The daemon as a process on emulated device nodes, as a hostile writer meets it: a record longer
 // than the device's reads must not turn its tail into an event of the writer's choosing, and a
 // node that vanishes and comes back must be read again.
-#include <signal.h>
-#include <spawn.h>
-#include <sqlite3.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <fstream>
 
 #include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
+#include "tests/plugins/daemon_process.h"
 #include "tests/plugins/devsim_process.h"
-#include "utils/file_util.h"
-
-extern char** environ;
 
 namespace android::Orvane {
 namespace {
@@ -25,58 +17,31 @@ class EventSourceDaemonTest : public ::testing::Test {
 protected:
     void SetUp() override {
         std::string failure;
-        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || !devsim_.Start(&failure))
+        if (!DaemonProcess::Built() || !devsim_.Start(&failure))
             GTEST_SKIP() << "the daemon or the device emulator is unavailable: " << failure;
         std::ofstream(folder_ + "/properties") << "ro.quor.build.region=CN\n";
-        std::string command = "ORVANE_PROPERTY_FILE=" + folder_ + "/properties exec setpriv --pdeathsig KILL " +
-                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " + folder_ +
-                              "/work -cloudCfgDir " + folder_ + "/cloud -devList qxev=" + devsim_.Path("qxev") +
-                              ",qx_exception_log=" + devsim_.Path("qx_exception_log") + " >" + folder_ +
-                              "/orvane.log 2>&1";
-        const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
-        ASSERT_EQ(posix_spawn(&daemon_, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
-    }
-    void TearDown() override {
-        if (daemon_ > 0 && kill(daemon_, SIGTERM) == 0)
-            waitpid(daemon_, nullptr, 0);
+        ASSERT_TRUE(daemon_.Start("qxev=" + devsim_.Path("qxev") +
+                                  ",qx_exception_log=" + devsim_.Path("qx_exception_log")));
     }
 
     size_t LogCount(const std::string& text) {
-        std::string log;
-        FileUtil::LoadStringFromFile(folder_ + "/orvane.log", log);
+        std::string log = daemon_.Log();
         size_t count = 0;
         for (size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1))
             ++count;
         return count;
     }
 
-    // "first_time|occured_cnt" of the event_info rows of an id, read from a copy, as the daemon's
-    // writes take no busy time-out.
+    // "first_time|occured_cnt" of the event_info rows of an id.
     std::string Stored(uint32_t eventId) {
-        std::string copy = folder_ + "/snapshot.db", rows;
-        std::string sql =
-                "select first_time || '|' || occured_cnt from event_info where event_id = " + std::to_string(eventId) +
-                " order by id;";
-        auto append = [](void* out, int, char** values, char**) {
-            *static_cast<std::string*>(out) += std::string(values[0] != nullptr ? values[0] : "NULL") + "\n";
-            return 0;
-        };
-        sqlite3* db = nullptr;
-        // The write-ahead log holds the latest commits until they are checkpointed into the file.
-        std::string work = folder_ + "/work/event.db";
-        if (system(("cp " + work + " " + copy + " 2>/dev/null && rm -f " + copy + "-wal " + copy + "-shm && { cp " +
-                    work + "-wal " + copy + "-wal 2>/dev/null; true; }")
-                           .c_str()) == 0 &&
-            sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK)
-            sqlite3_exec(db, sql.c_str(), append, &rows, nullptr);
-        sqlite3_close(db);
-        return rows;
+        return daemon_.Snapshot("select first_time || '|' || occured_cnt from event_info where event_id = " +
+                                std::to_string(eventId) + " order by id;");
     }
 
     TemporaryDir sandbox_;
     const std::string folder_ = sandbox_.path;
     DevSim devsim_;
-    pid_t daemon_ = -1;
+    DaemonProcess daemon_{folder_};
 };
 
 TEST_F(EventSourceDaemonTest, ForgedTailsAreNotStoredAndAVanishedNodeIsReadAgain) {

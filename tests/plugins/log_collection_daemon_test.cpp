@@ -1,19 +1,16 @@
 // The daemon as a process: a kernel record written to the emulated node ends as a log pack, and
 // "orvanectl pack-log" hands it over for upload.
-#include <signal.h>
-#include <spawn.h>
-#include <sys/wait.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "plugins/event_log_processor.h"
 #include "tests/common/log_capture.h"
+#include "tests/plugins/daemon_process.h"
 #include "tests/plugins/devsim_process.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/time_util.h"
-
-extern char** environ;
 
 namespace android::Orvane {
 namespace {
@@ -22,8 +19,7 @@ class LogCollectionDaemonTest : public ::testing::Test {
 protected:
     void SetUp() override {
         std::string failure;
-        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || access("/usr/bin/unzip", X_OK) != 0 ||
-            !devsim_.Start(&failure))
+        if (!DaemonProcess::Built() || access("/usr/bin/unzip", X_OK) != 0 || !devsim_.Start(&failure))
             GTEST_SKIP() << "the daemon, unzip or the device emulator is unavailable: " << failure;
         ASSERT_EQ(mkdir(root_.File("cloud").c_str(), 0775), 0);
         ASSERT_EQ(mkdir(root_.File("logs").c_str(), 0775), 0);
@@ -42,19 +38,8 @@ protected:
         policy.insert(paths + 10, "<Allow prefix=\"" + root_.path_ + "\"/>");
         WriteFile(root_.File("cloud/privacy_policy.xml"), policy);
     }
-    void TearDown() override {
-        if (daemon_ > 0 && kill(daemon_, SIGTERM) == 0)
-            waitpid(daemon_, nullptr, 0);
-    }
-
     void StartDaemon() {
-        std::string command = "ORVANE_PROPERTY_FILE=" + root_.File("properties") + " exec setpriv --pdeathsig KILL " +
-                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " +
-                              root_.File("work") + " -cloudCfgDir " + root_.File("cloud") +
-                              " -devList qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + root_.File("no_node") +
-                              " >>" + root_.File("orvane.log") + " 2>&1";
-        const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
-        ASSERT_EQ(posix_spawn(&daemon_, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
+        ASSERT_TRUE(daemon_.Start("qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + root_.File("no_node")));
     }
     // Runs a command line; its standard output, and its exit status in `status`.
     static std::string Run(const std::string& command, int* status) {
@@ -74,15 +59,14 @@ protected:
 
     DevSim devsim_;
     TempDir root_;
-    pid_t daemon_ = -1;
+    DaemonProcess daemon_{root_.path_};
 };
 
 TEST_F(LogCollectionDaemonTest, RecordEndsAsAPackThatPackLogHandsOver) {
     StartDaemon();
     ASSERT_TRUE(devsim_.Inject("qxev", "EventId 901001001 -t " + std::to_string(TimeUtil::GetTimestampSecond()) +
                                                " -paraList {\"reason\":\"test\"}"));
-    ASSERT_TRUE(WaitUntil([&] { return Packs("901").size() == 1; }, std::chrono::seconds(30)))
-            << ReadFile(root_.File("orvane.log"));
+    ASSERT_TRUE(WaitUntil([&] { return Packs("901").size() == 1; }, std::chrono::seconds(30))) << daemon_.Log();
     std::string pack = Packs("901").at(0);
     int status = 0;
     std::string listing = Run("unzip -t '" + pack + "' 2>&1", &status);

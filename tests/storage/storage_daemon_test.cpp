@@ -1,8 +1,6 @@
 // The daemon as a process, fed through emulated device nodes, while another process reads its store.
 #include <signal.h>
-#include <spawn.h>
 #include <sqlite3.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -13,11 +11,10 @@
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
+#include "tests/plugins/daemon_process.h"
 #include "tests/plugins/devsim_process.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/time_util.h"
-
-extern char** environ;
 
 namespace android::Orvane {
 namespace {
@@ -26,26 +23,13 @@ class StorageDaemonTest : public ::testing::Test {
 protected:
     void SetUp() override {
         std::string failure;
-        if (access(ORVANE_BINARY_DIR "/orvane", X_OK) != 0 || !devsim_.Start(&failure))
+        if (!DaemonProcess::Built() || !devsim_.Start(&failure))
             GTEST_SKIP() << "the daemon or the device emulator is unavailable: " << failure;
         WriteFile(root_.File("properties"), "ro.quor.build.region=CN\n");
     }
-    void TearDown() override { StopDaemon(); }
-
-    // The shipped configuration on the emulated kernel event node; the daemon's log goes to orvane.log.
+    // The shipped configuration on the emulated kernel event node.
     void StartDaemon() {
-        std::string command = "ORVANE_PROPERTY_FILE=" + root_.File("properties") + " exec setpriv --pdeathsig KILL " +
-                              ORVANE_BINARY_DIR "/orvane -configDir " ORVANE_SOURCE_DIR "/etc -workDir " +
-                              root_.File("work") + " -cloudCfgDir " + root_.File("cloud") +
-                              " -devList qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + root_.File("no_node") +
-                              " >>" + root_.File("orvane.log") + " 2>&1";
-        const char* argv[] = {"sh", "-c", command.c_str(), nullptr};
-        ASSERT_EQ(posix_spawn(&daemon_, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
-    }
-    void StopDaemon() {
-        if (daemon_ > 0 && kill(daemon_, SIGTERM) == 0)
-            waitpid(daemon_, nullptr, 0);
-        daemon_ = -1;
+        ASSERT_TRUE(daemon_.Start("qxev=" + devsim_.Path("qxev") + ",qx_exception_log=" + root_.File("no_node")));
     }
     void Record(uint32_t id, uint64_t happenTime, const std::string& params) {
         ASSERT_TRUE(devsim_.Inject("qxev", "EventId " + std::to_string(id) + " -t " + std::to_string(happenTime) +
@@ -62,7 +46,6 @@ protected:
                 },
                 std::chrono::seconds(30));
     }
-    std::string Log() { return ReadFile(root_.File("orvane.log")); }
     // A counter of the running daemon, read as an operator would (0 when it does not answer).
     uint64_t Counter(const std::string& name) {
         std::string command =
@@ -80,7 +63,7 @@ protected:
     DevSim devsim_;
     TempDir root_;
     std::string db_ = root_.File("work/event.db");
-    pid_t daemon_ = -1;
+    DaemonProcess daemon_{root_.path_};
 };
 
 // Another process reading event.db for a while (a shell, a backup) delays the daemon's writes but
@@ -89,7 +72,7 @@ TEST_F(StorageDaemonTest, ReaderHoldingATransactionCostsNoEvent) {
     uint64_t now = TimeUtil::GetTimestampSecond();
     StartDaemon();
     Record(903000001, now, "{\"warm\":1}");
-    ASSERT_TRUE(WaitStored("event_id = 903000001", 1)) << Log();
+    ASSERT_TRUE(WaitStored("event_id = 903000001", 1)) << daemon_.Log();
     sqlite3* reader = nullptr;
     ASSERT_EQ(sqlite3_open(db_.c_str(), &reader), SQLITE_OK);
     sqlite3_busy_timeout(reader, 20000);
@@ -100,7 +83,7 @@ TEST_F(StorageDaemonTest, ReaderHoldingATransactionCostsNoEvent) {
     std::this_thread::sleep_for(std::chrono::seconds(2));
     sqlite3_exec(reader, "COMMIT", nullptr, nullptr, nullptr);
     sqlite3_close(reader);
-    EXPECT_TRUE(WaitStored("event_id between 903001000 and 903001019", 20)) << Log();
+    EXPECT_TRUE(WaitStored("event_id between 903001000 and 903001019", 20)) << daemon_.Log();
 }
 
 // Killed while records pour in, the daemon keeps every event whose commit it reported, in a file
@@ -119,10 +102,8 @@ TEST_F(StorageDaemonTest, KillUnderLoadKeepsEveryReportedCommit) {
     EXPECT_TRUE(WaitUntil([&] { return (committed = Counter("storage.events.committed")) >= 2000; },
                           std::chrono::seconds(60)))
             << committed << " committed\n"
-            << Log();
-    ASSERT_EQ(kill(daemon_, SIGKILL), 0);
-    waitpid(daemon_, nullptr, 0);
-    daemon_ = -1;
+            << daemon_.Log();
+    ASSERT_TRUE(daemon_.Stop(SIGKILL));
     // Without its reader the node holds the writer; gone, it lets it go.
     stop = true;
     devsim_.Stop();
