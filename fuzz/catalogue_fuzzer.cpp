@@ -13,14 +13,9 @@
 
 using namespace android;
 using namespace android::Orvane;
+using FuzzDocuments::Check;
 
 namespace {
-
-void Check(bool holds) {
-    if (!holds) {
-        __builtin_trap();
-    }
-}
 
 void CheckEntry(const sp<EventInfoConfig>& entry, uint32_t id) {
     Check(entry->eventId == id);

@@ -35,6 +35,13 @@ inline void QuietLogs() {
     xmlSetGenericErrorFunc(nullptr, DropXmlError);
 }
 
+// A property of the input that must hold; a crash, so that the fuzzer keeps the input.
+inline void Check(bool holds) {
+    if (!holds) {
+        __builtin_trap();
+    }
+}
+
 // A folder of the process's own for the whole run, ending in "/".
 inline std::string Folder(const char* name) {
     std::string pattern = std::string("/tmp/") + name + ".XXXXXX";

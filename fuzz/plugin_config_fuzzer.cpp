@@ -13,14 +13,9 @@
 #include "platform/config.h"
 
 using namespace android::Orvane;
+using FuzzDocuments::Check;
 
 namespace {
-
-void Check(bool holds) {
-    if (!holds) {
-        __builtin_trap();
-    }
-}
 
 // Plugins are unique and their loop settings valid; pipelines name plugins defined before; a
 // source feeds pipelines that exist.

@@ -13,14 +13,9 @@
 
 using namespace android;
 using namespace android::Orvane;
+using FuzzDocuments::Check;
 
 namespace {
-
-void Check(bool holds) {
-    if (!holds) {
-        __builtin_trap();
-    }
-}
 
 // The name of the second element of text, if any: a section the input defines.
 std::string SecondElementName(const std::string& text) {

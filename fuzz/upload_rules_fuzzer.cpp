@@ -14,16 +14,7 @@
 
 using namespace android;
 using namespace android::Orvane;
-
-namespace {
-
-void Check(bool holds) {
-    if (!holds) {
-        __builtin_trap();
-    }
-}
-
-}  // namespace
+using FuzzDocuments::Check;
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
     FuzzDocuments::QuietLogs();
