@@ -16,6 +16,16 @@
 namespace android {
 namespace Orvane {
 
+// Categories of an event (its eventType), by which storage and log collection route it.
+inline constexpr uint32_t kEventTypeControl = 1;
+inline constexpr uint32_t kEventTypeFault = 2;
+inline constexpr uint32_t kEventTypeRaw = 4;
+
+// The ids of fault events: the ones that are stored, privacy-checked and may have logs collected.
+inline constexpr bool IsFaultEventId(uint32_t id) {
+    return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
+}
+
 // Value keys of an event that several components read or write.
 inline constexpr char kKeyParamList[] = "param_list";
 inline constexpr char kKeyRawEventDbId[] = "rawEventDbID";

@@ -370,7 +370,7 @@ void PluginPlatform::NotifyPlatformReady() {
         return;
     }
     event->eventId = 0;
-    event->eventType = 1;
+    event->eventType = kEventTypeControl;
     PostUnorderedEvent(event);
 }
 

@@ -40,9 +40,6 @@ ORVANE_REGISTER_PLUGIN(EventLogProcessor);
 
 namespace {
 
-constexpr uint32_t kControlType = 1;
-constexpr uint32_t kFaultType = 2;
-constexpr uint32_t kRawType = 4;
 constexpr uint32_t kPackLogId = 101;
 constexpr uint32_t kUploadSwitchId = 103;
 constexpr uint32_t kConfigUpdateId = 104;
@@ -59,10 +56,6 @@ constexpr size_t kPackSecondsKept = 256;
 constexpr char kKeyLogZipName[] = "EVENT_LOG_ZIP_NAME";
 constexpr char kUeOff[] = "ue_off";
 constexpr char kUploading[] = "uploading";
-
-bool IsLogId(uint32_t id) {
-    return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
-}
 
 std::string Domain(uint32_t id) {
     return std::to_string(id / kIdsPerDomain);
@@ -229,7 +222,7 @@ void EventLogProcessor::OnLoad() {
     osVersion_ = DevInfo::GetQuorVersion();
     counters_ = std::make_unique<Counters>(context_->GetStats());
     pathCheck_ = std::make_unique<PrivacyPathCheck>(*context_);
-    AddListenerInfo(kControlType, kConfigUpdateId, kConfigUpdateId);
+    AddListenerInfo(kEventTypeControl, kConfigUpdateId, kConfigUpdateId);
     context_->RegisterUnorderedEventListener(this);
     pool_ = new EventThreadPool(kWorkerCount, "proc_logger");
     pool_->Start();
@@ -245,10 +238,10 @@ EVENT_RET EventLogProcessor::OnEvent(sp<Event>& event) {
     uint32_t type = event->eventType;
     uint32_t id = event->eventId;
     OLOGD("%s EventLogProcessor event=%u,%d", id, static_cast<int>(type));
-    if (type == kRawType) {
+    if (type == kEventTypeRaw) {
         return 0;
     }
-    if (type == kControlType) {
+    if (type == kEventTypeControl) {
         if (id == kUploadSwitchId || id == kConfigUpdateId) {
             ProcessCfgOrUeUpdate(event);
         } else if (id == kPackLogId) {
@@ -262,10 +255,10 @@ EVENT_RET EventLogProcessor::OnEvent(sp<Event>& event) {
         }
         return 0;
     }
-    if (!IsLogId(id)) {
+    if (!IsFaultEventId(id)) {
         return -1;
     }
-    if (type != kFaultType || context_ == nullptr) {
+    if (type != kEventTypeFault || context_ == nullptr) {
         return 0;
     }
     loopThread_.Check("OnEvent");
@@ -301,7 +294,7 @@ void EventLogProcessor::QueueCollection(const sp<Event>& event) {
 }
 
 void EventLogProcessor::OnUnorderedEvent(sp<Event> event) {
-    if (event != nullptr && event->eventType == kControlType && event->eventId == kConfigUpdateId) {
+    if (event != nullptr && event->eventType == kEventTypeControl && event->eventId == kConfigUpdateId) {
         ProcessCfgOrUeUpdate(event);
     }
 }

@@ -21,10 +21,6 @@ namespace {
 
 constexpr char kCatalogueFile[] = "event.xml";
 
-bool IsFaultOrStatisticsId(uint32_t id) {
-    return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
-}
-
 }  // namespace
 
 void EventPrivacyCompliance::OnLoad() {
@@ -44,7 +40,7 @@ void EventPrivacyCompliance::OnLoad() {
 
 EVENT_RET EventPrivacyCompliance::OnEvent(sp<Event>& event) {
     loopThread_.Check("OnEvent");
-    if (event == nullptr || !IsFaultOrStatisticsId(event->eventId)) {
+    if (event == nullptr || !IsFaultEventId(event->eventId)) {
         return 0;
     }
     PluginContext* context = GetPluginContext();

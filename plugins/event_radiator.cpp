@@ -191,7 +191,7 @@ void EventRadiator::ParseEvent(char* record) {
     }
     sp<Event> event = new Event("EventRadiator");
     event->ResetTimestamp();
-    event->eventType = 2;  // a fault event, which log collection acts on
+    event->eventType = kEventTypeFault;  // log collection acts on fault events
     event->eventId = static_cast<uint32_t>(id.value);
     event->happenTime = time.value;
     // The value is cut from the record rather than taken from the token, so blanks inside the

@@ -18,8 +18,6 @@ ORVANE_REGISTER_PLUGIN(PerfLogAnalyzer);
 
 namespace {
 
-constexpr uint32_t kFaultEventType = 2;
-constexpr uint32_t kControlEventType = 1;
 constexpr uint32_t kConfigUpdateEventId = 104;
 // CPU time and I/O grow over this many seconds before processes are ranked.
 constexpr unsigned long kSampleSeconds = 1;
@@ -78,7 +76,7 @@ void PerfLogAnalyzer::OnLoad() {
         OLOGE("%s no plugin context, performance not watched");
         return;
     }
-    AddListenerInfo(kControlEventType, kConfigUpdateEventId);
+    AddListenerInfo(kEventTypeControl, kConfigUpdateEventId);
     context->RegisterUnorderedEventListener(this);
     PostToLoop([](PerfLogAnalyzer& self) { self.Configure(); });
 }
@@ -299,7 +297,7 @@ sp<Event> PerfLogAnalyzer::BuildEvent(const Report& report, const std::vector<To
     }
     root["top"] = list;
     sp<Event> event = new Event("PerfLogAnalyzer");
-    event->eventType = kFaultEventType;
+    event->eventType = kEventTypeFault;
     event->eventId = EventIdOf(report.resource);
     event->happenTime = TimeUtil::GetTimestampSecond();
     event->SetValue(kKeyParamList, JsonUtil::ConvertJsonToStr(root));

@@ -26,7 +26,6 @@ ORVANE_REGISTER_PLUGIN(RunLogManager);
 
 namespace {
 
-constexpr uint32_t kFaultEventType = 2;
 constexpr uint32_t kDefaultPeriodMinutes = 480;
 // A year. A longer period is cut to it, so that the loop's due time in nanoseconds cannot wrap
 // around into a run at once.
@@ -128,7 +127,7 @@ void RunLogManager::LogFilterStatics() {
             } else {
                 event->eventId = kEventId;
                 // Storage counts fault events by type and by the day they happened in.
-                event->eventType = kFaultEventType;
+                event->eventType = kEventTypeFault;
                 event->happenTime = TimeUtil::GetTimestampSecond();
                 event->SetValue("param_list", JsonUtil::ConvertJsonToStr(report));
                 if (context->InsertEventToPipeline(kPipeline, event)) {

@@ -28,7 +28,6 @@ using android::base::unique_fd;
 constexpr size_t kBinderThreads = 4;
 // The dump text goes to the caller in pieces of this size.
 constexpr size_t kDumpChunkBytes = 64 * 1024;
-constexpr uint32_t kControlEventType = 1;
 constexpr uint32_t kPackLogEventId = 101;
 constexpr uint32_t kUploadSwitchEventId = 103;
 constexpr uint32_t kConfigUpdateEventId = 104;
@@ -58,7 +57,7 @@ sp<Event> OrvaneService::CreateEvent(const char* op, uint32_t eventId) {
         return nullptr;
     }
     event->eventId = eventId;
-    event->eventType = kControlEventType;
+    event->eventType = kEventTypeControl;
     return event;
 }
 

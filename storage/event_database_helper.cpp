@@ -36,7 +36,6 @@ constexpr int kAbridgeMaxRounds = 16;
 constexpr int64_t kAbridgeMinRows = 8;
 constexpr int32_t kDumpDefaultRows = 20;
 constexpr uint32_t kOverQuotaEventId = 908001001;
-constexpr uint32_t kFaultEventType = 2;
 constexpr char kFaultPipeline[] = "dftFaultEvent";
 constexpr char kSender[] = "EventStorageManager";
 
@@ -329,7 +328,7 @@ void EventDatabaseHelper::ReportEventOverQuota(sp<Event> event, uint32_t dailyCn
         return;
     }
     sp<Event> report = new Event(kSender);
-    report->eventType = kFaultEventType;
+    report->eventType = kEventTypeFault;
     report->eventId = kOverQuotaEventId;
     report->happenTime = event->happenTime;
     char params[96];

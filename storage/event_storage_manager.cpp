@@ -30,8 +30,6 @@ constexpr char kPropSafeCheck[] = "persist.sys.orvane.safecheck";
 constexpr uint32_t kDefaultCheckSize = 209715200;
 constexpr uint32_t kDefaultCheckTime = 86400;
 
-constexpr uint32_t kCategoryControl = 1;
-constexpr uint32_t kCategoryRaw = 4;
 constexpr uint32_t kUserActivateEventId = 105;
 constexpr uint32_t kRawIdMin = 100000;
 constexpr uint32_t kRawIdMax = 199999;
@@ -39,10 +37,6 @@ constexpr uint32_t kRawIdMax = 199999;
 constexpr EVENT_RET kNotStored = static_cast<EVENT_RET>(0xFFFFFFFFu);
 // How long a dump waits for the storage loop before giving up, in nanoseconds.
 constexpr nsecs_t kDumpWaitNs = 10000000000LL;
-
-bool IsFaultId(uint32_t id) {
-    return (id >= 800000000 && id <= 888888888) || (id >= 900000000 && id <= 999999999);
-}
 
 // A dump handed to the storage loop: its own copy of the caller's descriptor, which it closes when
 // done, and the flag the caller waits on.
@@ -147,18 +141,18 @@ void EventStorageManager::QueueCommit(const sp<EventLoop>& loop) {
 EVENT_RET EventStorageManager::Store(sp<Event>& event) {
     OLOGD("%s EventStorageManager event=%u,%d", event->eventId, static_cast<int>(event->eventType));
     switch (event->eventType) {
-        case kCategoryRaw:
+        case kEventTypeRaw:
             if (event->eventId >= kRawIdMin && event->eventId <= kRawIdMax) {
                 helper_->SaveRawEvent(event);
             }
             return 0;
-        case kCategoryControl:
+        case kEventTypeControl:
             if (event->eventId == kUserActivateEventId) {
                 helper_->SaveUserActivateTime(event);
             }
             return 0;
         default:
-            if (!IsFaultId(event->eventId)) {
+            if (!IsFaultEventId(event->eventId)) {
                 return kNotStored;
             }
             helper_->ProcessFaultEvent(event);
