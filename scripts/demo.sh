@@ -127,6 +127,11 @@ wait_for() {
 
 section() { printf '\n== %s\n' "$*"; }
 
+# True once event.db holds a row of the event id $1.
+event_stored() {
+    [ "$(sqlite3 "$DB" "select count(*) from event_info where event_id = $1;" 2> /dev/null)" != 0 ]
+}
+
 # Log collection on a host: cloud copies of the log rules, with sources that exist on Linux and
 # in the sandbox, and of the privacy policy, which also lets in the sandbox's log folders (the
 # folder "private" stays out, so one source of the wlan rule is refused).
@@ -442,10 +447,7 @@ run_perf_demo() {
     "$BUILD/orvane-pressure" cpu 40 > "$SANDBOX/pressure.log" 2>&1 &
     PRESSURE_PID=$!
     echo "orvane-pressure cpu: two spinning threads per CPU at the lowest priority, at most 40 s"
-    perf_stored() {
-        [ "$(sqlite3 "$DB" "select count(*) from event_info where event_id = 909001001;" 2> /dev/null)" != 0 ]
-    }
-    if wait_for 40 perf_stored; then
+    if wait_for 40 event_stored 909001001; then
         echo "the trigger fired and event 909001001 was stored"
     else
         echo "no performance event within 40 s"
@@ -462,10 +464,7 @@ run_perf_demo() {
 run_log_filter_demo() {
     section "log filter statistics: orvanectl dump plugin RunLogManager run"
     "$BUILD/orvanectl" --workdir "$WORK" dump plugin RunLogManager run || return 0
-    filter_stored() {
-        [ "$(sqlite3 "$DB" "select count(*) from event_info where event_id = 908002001;" 2> /dev/null)" != 0 ]
-    }
-    if wait_for 20 filter_stored; then
+    if wait_for 20 event_stored 908002001; then
         echo "event 908002001 was stored"
     else
         echo "no log filter event within 20 s"
