@@ -60,21 +60,6 @@ ino_t PlainFileInode(const std::string& path, struct stat& st) {
     return lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) ? st.st_ino : 0;
 }
 
-bool WriteAll(int fd, const std::string& text) {
-    size_t done = 0;
-    while (done < text.size()) {
-        ssize_t n = TEMP_FAILURE_RETRY(write(fd, text.data() + done, text.size() - done));
-        if (n <= 0) {
-            if (n == 0) {
-                errno = ENOSPC;
-            }
-            return false;
-        }
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
 }  // namespace
 
 void EventInfoPack::OnLoad() {
@@ -208,7 +193,7 @@ bool EventInfoPack::Append(uint32_t domain, const std::string& line) {
     state.files[path] = st.st_ino;
     // One write per line, then the data to the disk: a kill leaves whole lines only. A write that
     // fails half-way (a full disk) is cut off again so the earlier lines stay as they were.
-    if (!WriteAll(fd.get(), line) || fsync(fd.get()) != 0) {
+    if (!android::base::WriteFully(fd, line.data(), line.size()) || fsync(fd.get()) != 0) {
         int error = errno;
         if (ftruncate(fd.get(), st.st_size) != 0 || fsync(fd.get()) != 0) {
             OLOGE_LIMITED("%s %s may end in a cut line: %s", path.c_str(), strerror(errno));
