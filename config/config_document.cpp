@@ -8,6 +8,7 @@
 #include "config/xml_parser.h"
 #include "utils/orvane_log.h"
 #include "utils/string_util.h"
+#include "utils/time_util.h"
 
 namespace android {
 namespace Orvane {
@@ -29,6 +30,39 @@ struct Verdict {
 
 Mutex gVerdictMutex;
 std::map<std::string, Verdict> gVerdicts GUARDED_BY(gVerdictMutex);
+
+// Readers choose at every event, thousands of times a second under load, while documents change
+// a few times a day; so a stamp is taken again only once it is a second old, or at once after
+// Forget (an announced update). Paths are few (documents times folders), and the map is emptied
+// should a caller bring ever new folders.
+constexpr int64_t kStampLifeNs = 1000000000;
+constexpr size_t kMaxStamps = 256;
+
+struct TakenStamp {
+    FileStamp stamp;
+    int64_t takenNs = 0;
+};
+
+Mutex gStampMutex;
+std::map<std::string, TakenStamp> gStamps GUARDED_BY(gStampMutex);
+
+FileStamp RecentStamp(const std::string& path) {
+    int64_t now = TimeUtil::GetNanoSecondSinceSystemStart();
+    {
+        Mutex::Autolock lock(gStampMutex);
+        auto found = gStamps.find(path);
+        if (found != gStamps.end() && now - found->second.takenNs < kStampLifeNs) {
+            return found->second.stamp;
+        }
+    }
+    FileStamp stamp = FileUtil::GetFileStamp(path);
+    Mutex::Autolock lock(gStampMutex);
+    if (gStamps.size() >= kMaxStamps) {
+        gStamps.clear();
+    }
+    gStamps[path] = {stamp, now};
+    return stamp;
+}
 
 // An archive "dir/x.zip" holds the document as its entry "x.xml"; "" for a plain document.
 std::string ArchiveEntry(const std::string& path) {
@@ -80,7 +114,7 @@ DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std:
     const std::string& configDir = folders.configDir;
     if (folders.cloudDir != configDir) {
         DocumentChoice cloud{folders.cloudDir, folders.cloudDir + fileName, {}, true};
-        cloud.stamp = FileUtil::GetFileStamp(cloud.path);
+        cloud.stamp = RecentStamp(cloud.path);
         bool fresh = false;
         if (cloud.stamp.size >= 0 && CheckWellFormed(cloud.path, cloud.stamp, fresh)) {
             return cloud;
@@ -92,8 +126,13 @@ DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std:
         }
     }
     DocumentChoice system{configDir, configDir + fileName, {}, false};
-    system.stamp = FileUtil::GetFileStamp(system.path);
+    system.stamp = RecentStamp(system.path);
     return system;
+}
+
+void ConfigDocument::Forget() {
+    Mutex::Autolock lock(gStampMutex);
+    gStamps.clear();
 }
 
 }  // namespace Orvane

@@ -43,17 +43,21 @@ struct DocumentChoice {
 // "config-update") wins when it exists and is well-formed XML (for an archive "x.zip": its entry
 // "x.xml"); else the system copy is read. A cloud copy that does not parse is passed over with one
 // warning line per version of the file, and counted ("config.cloud_rejected.<file>"). Each
-// version is judged once (FileStamp), so the common call costs one stat per candidate.
+// version is judged once (FileStamp), and a file's stamp is taken at most once a second, so the
+// common call costs no system call.
 //
 // How a reader uses it, at every query: choose, compare the choice with the one it holds
 // (SameVersion), and read the chosen copy again when it differs; that is how a pushed
-// configuration reaches every reader on its next use, without a restart. A failed read is logged
-// as the reader's own line and counted as "config.read_failed.<file>".
+// configuration reaches every reader without a restart: at its next use after an announced update
+// (Forget), within a second after a copy changed unannounced. A failed read is logged as the
+// reader's own line and counted as "config.read_failed.<file>".
 //
 // Threads: any thread; the verdicts are kept under one lock, the checks run outside it.
 namespace ConfigDocument {
 
 DocumentChoice Choose(const DocumentFolders& folders, const std::string& fileName);
+// Makes the next choices look at the files again: new copies have been announced.
+void Forget();
 // True when the whole file parses as XML (no entities, no network), checked once per version.
 bool IsWellFormed(const std::string& path, const FileStamp& stamp);
 

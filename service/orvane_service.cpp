@@ -12,6 +12,7 @@
 
 #include <android-base/unique_fd.h>
 
+#include "config/config_document.h"
 #include "service/binder_transport.h"
 #include "service/caller_writer.h"
 #include "service/orvane_native_service.h"
@@ -87,6 +88,7 @@ void OrvaneService::NotifyUploadSwitch(bool on) {
 
 void OrvaneService::NotifyConfigUpdate(const std::string& folder) {
     platform_->SetCloudConfigFolder(folder);
+    ConfigDocument::Forget();
     sp<Event> event = CreateEvent(__func__, kConfigUpdateEventId);
     if (event == nullptr) {
         return;

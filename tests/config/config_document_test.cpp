@@ -2,19 +2,21 @@
 
 #include <zip.h>
 
-#include <fstream>
+#include <chrono>
+#include <thread>
 #include <tuple>
 
 #include <android-base/file.h>
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
 
 void Write(const std::string& path, const std::string& content) {
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
+    ASSERT_TRUE(WriteDocument(content, path));
 }
 
 // The cloud copy wins only while it parses; a broken one is reported once per version and
@@ -54,6 +56,22 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 3u);
 }
 
+// A copy changed without an announcement still reaches the readers, once the stamp taken of
+// the file has aged (a second), without a restart.
+TEST(ConfigDocumentTest, UnannouncedChangeIsSeenSoon) {
+    TemporaryDir system, cloud;
+    std::string sys = std::string(system.path) + "/", cld = std::string(cloud.path) + "/";
+    Write(sys + "a.xml", "<a/>");
+    ASSERT_FALSE(ConfigDocument::Choose({cld, sys, nullptr}, "a.xml").fromCloud);
+    ASSERT_TRUE(base::WriteStringToFile("<a><b/></a>", cld + "a.xml"));
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (!ConfigDocument::Choose({cld, sys, nullptr}, "a.xml").fromCloud &&
+           std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    EXPECT_TRUE(ConfigDocument::Choose({cld, sys, nullptr}, "a.xml").fromCloud);
+}
+
 // An archive copy is judged by its document entry ("x.zip" holds "x.xml"), not as XML itself.
 TEST(ConfigDocumentTest, ArchiveCopyIsJudgedByItsEntry) {
     TemporaryDir system, cloud;
@@ -67,6 +85,7 @@ TEST(ConfigDocumentTest, ArchiveCopyIsJudgedByItsEntry) {
         EXPECT_EQ(zipWriteInFileInZip(archive, content.data(), content.size()), ZIP_OK);
         EXPECT_EQ(zipCloseFileInZip(archive), ZIP_OK);
         EXPECT_EQ(zipClose(archive, nullptr), ZIP_OK);
+        ConfigDocument::Forget();
     };
     DaemonStats stats;
     const std::tuple<std::string, std::string, bool> cases[] = {

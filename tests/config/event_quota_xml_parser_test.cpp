@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
@@ -20,7 +21,7 @@ class EventQuotaXmlParserTest : public ::testing::Test {
 protected:
     // Replaces the document at once, as a push does, so a concurrent reader sees the old or the new one.
     void Write(const std::string& content) {
-        ASSERT_TRUE(android::base::WriteStringToFile(content, dir_ + "next.xml"));
+        ASSERT_TRUE(WriteDocument(content, dir_ + "next.xml"));
         ASSERT_EQ(rename((dir_ + "next.xml").c_str(), (dir_ + "event_quota.xml").c_str()), 0);
     }
     // dailyCnt maxLogCnt logSpace same logCnt of the quota for id.
@@ -107,7 +108,7 @@ TEST_F(EventQuotaXmlParserTest, ReadsAgainOnlyWhenTheChosenCopyOrTheSectionChang
         EXPECT_EQ(Quota(960000001, absent), (std::vector<int64_t>{200, 10, 300, 0, 0}));
     EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "StartParserXml parse xml file failed " + absent.configDir), 1u);
     EXPECT_EQ(stats.Value("config.read_failed.event_quota.xml"), 1u);
-    ASSERT_TRUE(android::base::WriteStringToFile("<Q><unknown><Summary defDailyCnt=\"44\"/></unknown></Q>",
+    ASSERT_TRUE(WriteDocument("<Q><unknown><Summary defDailyCnt=\"44\"/></unknown></Q>",
                                                  absent.configDir + "event_quota.xml"));
     EXPECT_EQ(Quota(960000001, absent)[0], 44);
 }

@@ -15,6 +15,7 @@
 
 #include "tests/common/log_capture.h"
 #include "utils/string_util.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
@@ -34,7 +35,7 @@ std::string Document(const std::string& entries) {
 class EventXmlParserTest : public ::testing::Test {
 protected:
     void Write(const std::string& entries, const std::string& dir = "") {
-        ASSERT_TRUE(android::base::WriteStringToFile(Document(entries), (dir.empty() ? dir_ : dir) + "event.xml"));
+        ASSERT_TRUE(WriteDocument(Document(entries), (dir.empty() ? dir_ : dir) + "event.xml"));
     }
     // Changes the text in place but leaves the file's stamp (size, time) as it was: a change the
     // cache cannot see, so that what the cache holds shows.
@@ -43,7 +44,7 @@ protected:
         std::string path = dir_ + "event.xml", text;
         struct stat before;
         ASSERT_TRUE(stat(path.c_str(), &before) == 0 && android::base::ReadFileToString(path, &text));
-        ASSERT_TRUE(android::base::WriteStringToFile(StringUtil::ReplaceStr(text, from, to), path));
+        ASSERT_TRUE(WriteDocument(StringUtil::ReplaceStr(text, from, to), path));
         const struct timespec times[2] = {before.st_atim, before.st_mtim};
         ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
     }
@@ -172,7 +173,7 @@ TEST_F(EventXmlParserTest, CopyInForceIsReadAndItsChangeDropsTheCache) {
     EXPECT_EQ(level(914000001), 3);
     Write(Entry(914000001, "FaultLevel=\"CRITICAL\""), cloudDir);  // pushed again
     EXPECT_EQ(level(914000001), 4);
-    ASSERT_TRUE(android::base::WriteStringToFile("<Events><Event id=\"914000001\" FaultLevel=\"2\">",
+    ASSERT_TRUE(WriteDocument("<Events><Event id=\"914000001\" FaultLevel=\"2\">",
                                                  cloudDir + "event.xml"));
     EXPECT_EQ(level(914000001), 1);  // a broken push is passed over
     EXPECT_EQ(stats.Value("config.cloud_rejected.event.xml"), 1u);
@@ -180,6 +181,7 @@ TEST_F(EventXmlParserTest, CopyInForceIsReadAndItsChangeDropsTheCache) {
     LogCapture logs;
     ASSERT_EQ(unlink((dir_ + "event.xml").c_str()), 0);
     ASSERT_EQ(unlink((cloudDir + "event.xml").c_str()), 0);
+    ConfigDocument::Forget();
     for (int i = 0; i < 5; ++i)
         EXPECT_EQ(level(914000001), -1);
     EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "upload failed"), 1u) << logs.Dump();

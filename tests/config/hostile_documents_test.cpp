@@ -9,6 +9,7 @@
 
 #include "config/event_quota_xml_parser.h"
 #include "config/event_xml_parser.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
@@ -85,8 +86,8 @@ TEST(HostileDocumentsTest, NeitherCrashNorLeakNorPassAsAPushedCopy) {
         const std::string sys = std::string(system.path) + "/", cld = std::string(cloud.path) + "/";
         // As the system copy: what was read before the error, else the defaults. Deep nesting
         // costs the push parser memory, not stack: it reads on to the mismatched end tag.
-        ASSERT_TRUE(android::base::WriteStringToFile(hostile.quota, sys + "event_quota.xml"));
-        ASSERT_TRUE(android::base::WriteStringToFile(hostile.catalogue, sys + "event.xml"));
+        ASSERT_TRUE(WriteDocument(hostile.quota, sys + "event_quota.xml"));
+        ASSERT_TRUE(WriteDocument(hostile.catalogue, sys + "event.xml"));
         EventQuotaXmlParser::DomainQuota q = quota->GetEventQuota(sys, "unknown", kId);
         EXPECT_EQ((std::vector<uint32_t>{q.dailyCnt, q.maxLogCnt}), hostile.quotaAsRead);
         sp<EventInfoConfig> entry = catalogue->GetEventInfoConfig(sys, kId);
@@ -99,11 +100,11 @@ TEST(HostileDocumentsTest, NeitherCrashNorLeakNorPassAsAPushedCopy) {
         // As a pushed copy over a good system copy: passed over unless well-formed.
         DaemonStats stats;
         DocumentFolders folders(cld, sys, &stats);
-        ASSERT_TRUE(android::base::WriteStringToFile(Quota("<Summary defDailyCnt=\"5\"/>"), sys + "event_quota.xml"));
-        ASSERT_TRUE(android::base::WriteStringToFile(
+        ASSERT_TRUE(WriteDocument(Quota("<Summary defDailyCnt=\"5\"/>"), sys + "event_quota.xml"));
+        ASSERT_TRUE(WriteDocument(
                 Catalogue("<Event id=\"" + std::to_string(kId) + "\" FaultLevel=\"2\"/>"), sys + "event.xml"));
-        ASSERT_TRUE(android::base::WriteStringToFile(hostile.quota, cld + "event_quota.xml"));
-        ASSERT_TRUE(android::base::WriteStringToFile(hostile.catalogue, cld + "event.xml"));
+        ASSERT_TRUE(WriteDocument(hostile.quota, cld + "event_quota.xml"));
+        ASSERT_TRUE(WriteDocument(hostile.catalogue, cld + "event.xml"));
         EXPECT_EQ(quota->GetEventQuota(folders, "unknown", kId).dailyCnt, hostile.wellFormed ? 7u : 5u);
         entry = catalogue->GetEventInfoConfig(folders, kId);
         EXPECT_EQ(entry != nullptr && entry->faultLevel == 2, !hostile.wellFormed);

@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
-#include <fstream>
 
 #include <android-base/file.h>
 #include <gtest/gtest.h>
@@ -11,12 +10,13 @@
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
 #include "tests/common/test_data.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
 
 void Write(const std::string& path, const std::string& content) {
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
+    ASSERT_TRUE(WriteDocument(content, path));
 }
 
 std::string Describe(const std::vector<PerfResourceConfig>& resources) {
@@ -109,6 +109,7 @@ TEST(PerfConfigXmlParserTest, DocumentFollowsTheChosenCopyAndItsVersions) {
     Write(systemCopy, R"(<PerfConfig><Resource name="cpu" someStallUs="6" windowUs="2000000"/></PerfConfig>)");
     struct timespec later[2] = {{0, UTIME_OMIT}, {time(nullptr) + 5, 0}};
     ASSERT_EQ(0, utimensat(AT_FDCWD, systemCopy.c_str(), later, 0));
+    ConfigDocument::Forget();
     ASSERT_TRUE(document.Refresh(context));
     EXPECT_EQ("cpu:6/0/2000000/600/5 ", Describe(document.Resources()));
 
@@ -119,6 +120,7 @@ TEST(PerfConfigXmlParserTest, DocumentFollowsTheChosenCopyAndItsVersions) {
     EXPECT_EQ("io:7/0/4000000/600/5 ", Describe(document.Resources()));
     EXPECT_FALSE(document.Refresh(context));
     ASSERT_EQ(0, unlink(cloudCopy.c_str()));
+    ConfigDocument::Forget();
     ASSERT_TRUE(document.Refresh(context));
     EXPECT_EQ(systemCopy, document.Path());
     EXPECT_EQ("cpu:6/0/2000000/600/5 ", Describe(document.Resources()));

@@ -9,11 +9,11 @@
 #include "tests/common/envelope_opener.h"
 #include "tests/common/log_capture.h"
 #include "tests/common/test_data.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
 
-using android::base::WriteStringToFile;
 
 std::string Policy(const std::string& levels, const std::string& body = "") {
     return "<PrivacyPolicy>" + levels + body + "</PrivacyPolicy>\n";
@@ -77,10 +77,10 @@ TEST_F(PrivacyPolicyTest, BadDocumentsLeaveThePolicyInForce) {
     EXPECT_EQ(capture.Count(ANDROID_LOG_ERROR, "refused (missing)"), 1u) << capture.Dump();
 
     std::string path = config_ + PrivacyPolicyParser::kFileName;
-    ASSERT_TRUE(WriteStringToFile("<PrivacyPolicy><Levels switchOn=\"L9\" switchOff=\"1\"/></PrivacyPolicy>", path));
+    ASSERT_TRUE(WriteDocument("<PrivacyPolicy><Levels switchOn=\"L9\" switchOff=\"1\"/></PrivacyPolicy>", path));
     EXPECT_EQ(Get(), PrivacyPolicy::Safest());
 
-    ASSERT_TRUE(WriteStringToFile(
+    ASSERT_TRUE(WriteDocument(
             Policy("<Levels switchOn=\"4\" switchOff=\"L2\"/>", "<LogPaths><Allow prefix=\"/data/log\"/></LogPaths>"),
             path));
     auto good = Get();
@@ -119,7 +119,7 @@ TEST_F(PrivacyPolicyTest, BadDocumentsLeaveThePolicyInForce) {
     };
     int version = 0;
     for (const std::string& document : hostile) {
-        ASSERT_TRUE(WriteStringToFile(document, path));
+        ASSERT_TRUE(WriteDocument(document, path));
         capture.Clear();
         EXPECT_EQ(Get(), good) << "document " << version;
         EXPECT_EQ(Get(), good);
@@ -137,10 +137,10 @@ TEST_F(PrivacyPolicyTest, BadDocumentsLeaveThePolicyInForce) {
 TEST_F(PrivacyPolicyTest, ReloadsOnChangeOnlyAndFindsTheKeyBesideTheCopyInForce) {
     std::string publicPem, privatePem;
     EnvelopeOpener::MakeKeyPair(publicPem, privatePem);
-    ASSERT_TRUE(WriteStringToFile(publicPem, config_ + "server.pem"));
+    ASSERT_TRUE(WriteDocument(publicPem, config_ + "server.pem"));
     const std::string identifiers = "<Identifiers key=\"server.pem\"><Param name=\"serial\"/></Identifiers>";
     std::string system = config_ + PrivacyPolicyParser::kFileName;
-    ASSERT_TRUE(WriteStringToFile(Policy("<Levels switchOn=\"3\" switchOff=\"2\"/>", identifiers), system));
+    ASSERT_TRUE(WriteDocument(Policy("<Levels switchOn=\"3\" switchOff=\"2\"/>", identifiers), system));
     LogCapture capture;
     auto first = Get();
     EXPECT_EQ(first->source, system);
@@ -152,12 +152,13 @@ TEST_F(PrivacyPolicyTest, ReloadsOnChangeOnlyAndFindsTheKeyBesideTheCopyInForce)
 
     struct timespec later[2] = {{0, UTIME_OMIT}, {time(nullptr) + 10, 0}};  // a touch: same text, new stamp
     ASSERT_EQ(utimensat(AT_FDCWD, system.c_str(), later, 0), 0);
+    ConfigDocument::Forget();
     auto touched = Get();
     EXPECT_NE(touched, first);
     EXPECT_EQ(touched->MaxLevel(true), 3u);
 
     std::string cloud = cloud_ + PrivacyPolicyParser::kFileName;
-    ASSERT_TRUE(WriteStringToFile(Policy("<Levels switchOn=\"4\" switchOff=\"1\"/>", identifiers), cloud));
+    ASSERT_TRUE(WriteDocument(Policy("<Levels switchOn=\"4\" switchOff=\"1\"/>", identifiers), cloud));
     auto pushed = Get();
     EXPECT_EQ(pushed->source, cloud);
     EXPECT_EQ(pushed->MaxLevel(false), 1u);
@@ -167,6 +168,7 @@ TEST_F(PrivacyPolicyTest, ReloadsOnChangeOnlyAndFindsTheKeyBesideTheCopyInForce)
     EXPECT_EQ(capture.Count(ANDROID_LOG_WARN, "identifiers are removed"), 1u);
 
     ASSERT_EQ(unlink(cloud.c_str()), 0);
+    ConfigDocument::Forget();
     EXPECT_EQ(Get()->source, system);
     EXPECT_EQ(capture.Dump().find(publicPem.substr(30, 20)), std::string::npos);
 }

@@ -14,6 +14,7 @@
 #include "tests/common/log_capture.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
@@ -60,9 +61,9 @@ constexpr uint32_t kUnknown = 901000777;
 class EventPrivacyComplianceTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        ASSERT_TRUE(android::base::WriteStringToFile(kCatalogue, config_ + "event.xml"));
+        ASSERT_TRUE(WriteDocument(kCatalogue, config_ + "event.xml"));
         EnvelopeOpener::MakeKeyPair(publicPem_, privatePem_);
-        ASSERT_TRUE(android::base::WriteStringToFile(publicPem_, config_ + "server.pem"));
+        ASSERT_TRUE(WriteDocument(publicPem_, config_ + "server.pem"));
         WritePolicy("strip");
         DevInfo::SetUploadSwitch(1);
         plugin_->SetPluginContext(&context_);
@@ -76,7 +77,7 @@ protected:
                            "\"/><Identifiers key=\"" + key +
                            "\" level=\"4\"/><FilterList params=\"pkg process\"><Name value=\"com.secret\"/>"
                            "<Name pattern=\"com.bank.*\"/></FilterList></PrivacyPolicy>";
-        ASSERT_TRUE(android::base::WriteStringToFile(text, config_ + "policy.tmp"));
+        ASSERT_TRUE(WriteDocument(text, config_ + "policy.tmp"));
         ASSERT_EQ(rename((config_ + "policy.tmp").c_str(), (config_ + "privacy_policy.xml").c_str()), 0);
     }
 

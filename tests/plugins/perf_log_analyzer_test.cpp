@@ -11,7 +11,6 @@
 #include <algorithm>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
 
 #include <android-base/file.h>
 #include <android-base/unique_fd.h>
@@ -24,6 +23,7 @@
 #include "tests/common/log_capture.h"
 #include "tests/common/test_data.h"
 #include "utils/json_util.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
@@ -31,7 +31,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 void Write(const std::string& path, const std::string& content) {
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
+    ASSERT_TRUE(WriteDocument(content, path));
 }
 
 // Whether a thread of this process carries the name.

@@ -14,12 +14,12 @@
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
 #include "utils/zip_pack.h"
+#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {
 
 using android::base::ReadFdToString;
-using android::base::WriteStringToFile;
 
 class PrivacyPathCheckTest : public ::testing::Test {
 protected:
@@ -28,12 +28,12 @@ protected:
             ASSERT_EQ(mkdir((root_ + folder).c_str(), 0775), 0);
         }
         WritePolicy("<Allow prefix=\"" + root_ + "/logs/\"/><Deny pattern=\"*/private/*\"/><Deny pattern=\"*.db\"/>");
-        ASSERT_TRUE(WriteStringToFile("log line", root_ + "/logs/a.txt"));
-        ASSERT_TRUE(WriteStringToFile("secret", root_ + "/private/secret.txt"));
-        ASSERT_TRUE(WriteStringToFile("inner secret", root_ + "/logs/private/inner.txt"));
+        ASSERT_TRUE(WriteDocument("log line", root_ + "/logs/a.txt"));
+        ASSERT_TRUE(WriteDocument("secret", root_ + "/private/secret.txt"));
+        ASSERT_TRUE(WriteDocument("inner secret", root_ + "/logs/private/inner.txt"));
     }
     void WritePolicy(const std::string& paths) {
-        ASSERT_TRUE(WriteStringToFile("<PrivacyPolicy><Levels switchOn=\"1\" switchOff=\"1\"/><LogPaths>" + paths +
+        ASSERT_TRUE(WriteDocument("<PrivacyPolicy><Levels switchOn=\"1\" switchOff=\"1\"/><LogPaths>" + paths +
                                               "</LogPaths></PrivacyPolicy>",
                                       root_ + "/etc/tmp"));
         ASSERT_EQ(rename((root_ + "/etc/tmp").c_str(), (root_ + "/etc/privacy_policy.xml").c_str()), 0);
@@ -61,7 +61,7 @@ TEST_F(PrivacyPathCheckTest, JudgesTheResolvedFile) {
     ASSERT_EQ(symlink("a.txt", (logs + "sub/../same").c_str()), 0);
     ASSERT_EQ(link((root_ + "/private/secret.txt").c_str(), (logs + "hard").c_str()), 0);
     ASSERT_EQ(mkfifo((logs + "fifo").c_str(), 0600), 0);
-    ASSERT_TRUE(WriteStringToFile("x", logs + "events.db"));
+    ASSERT_TRUE(WriteDocument("x", logs + "events.db"));
     LogCapture capture;
     for (const std::string& allowed : {logs + "a.txt", logs + "sub/../a.txt", logs + "./same", logs + "/a.txt"}) {
         EXPECT_TRUE(check_.IsPrivacycompliance(allowed)) << allowed;
@@ -98,7 +98,7 @@ TEST_F(PrivacyPathCheckTest, SwapsBetweenCheckAndOpenCannotPass) {
     std::atomic<bool> done{false};
     std::thread swapper([&] {
         while (!done) {
-            WriteStringToFile("log line", plain);
+            WriteDocument("log line", plain);
             rename(plain.c_str(), path.c_str());
             symlink((root_ + "/private/secret.txt").c_str(), link.c_str());
             rename(link.c_str(), path.c_str());
@@ -125,7 +125,7 @@ TEST_F(PrivacyPathCheckTest, SwapsBetweenCheckAndOpenCannotPass) {
     EXPECT_TRUE(mixed) << opened << " opened, " << refused << " refused";
 
     // Packed from the descriptor: the file that was judged and opened, whatever the path names now.
-    ASSERT_TRUE(WriteStringToFile("log line", plain));
+    ASSERT_TRUE(WriteDocument("log line", plain));
     ASSERT_EQ(rename(plain.c_str(), path.c_str()), 0);
     android::base::unique_fd fd = check_.OpenCompliantFile(path);
     ASSERT_GE(fd.get(), 0);
