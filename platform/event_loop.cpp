@@ -19,6 +19,9 @@ constexpr uint64_t kNsPerMs = 1000000;
 constexpr uint64_t kSlowEntryUs = 301000;
 constexpr uint64_t kAddFailed = UINT64_MAX;
 
+// The loop whose entries the calling thread runs, if any.
+thread_local EventLoop* tRunningLoop = nullptr;
+
 uint64_t Now() {
     return static_cast<uint64_t>(TimeUtil::GetNanoSecondSinceSystemStart());
 }
@@ -98,6 +101,7 @@ LoopEvent EventLoop::NewEntry(unsigned long delaySeconds, bool repeat) const {
 
 uint64_t EventLoop::Enqueue(LoopEvent entry) {
     uint64_t id = entry.createTime;
+    bool deferrable = entry.taskType == 0 && tRunningLoop != nullptr && tRunningLoop != this;
     bool wake = false;
     {
         Mutex::Autolock lock(mutex_);
@@ -107,10 +111,38 @@ uint64_t EventLoop::Enqueue(LoopEvent entry) {
         PushLocked(std::move(entry));
         wake = sleeping_;
     }
-    if (wake) {
+    if (wake && !(deferrable && tRunningLoop->DeferWake(this))) {
         looper_->wake();
     }
     return id;
+}
+
+bool EventLoop::DeferWake(EventLoop* receiver) {
+    if (!HasDueEntry()) {
+        return false;
+    }
+    if (deferredWakes_.empty()) {
+        deferredSinceNs_ = Now();
+    }
+    for (const sp<EventLoop>& owed : deferredWakes_) {
+        if (owed.get() == receiver) {
+            return true;
+        }
+    }
+    deferredWakes_.emplace_back(receiver);
+    return true;
+}
+
+bool EventLoop::HasDueEntry() {
+    Mutex::Autolock lock(mutex_);
+    return !queue_.empty() && queue_.front().targetTime <= Now();
+}
+
+void EventLoop::WakeDeferred() {
+    for (const sp<EventLoop>& owed : deferredWakes_) {
+        owed->looper_->wake();
+    }
+    deferredWakes_.clear();
 }
 
 void EventLoop::PushLocked(LoopEvent&& entry) {
@@ -169,6 +201,7 @@ void EventLoop::ProcessEventLoop() {
         // Empty while another thread destroys this loop; that thread's stop wakes the sleep.
         sp<EventLoop> self = wp<EventLoop>(this).promote();
         bool pending = false;
+        tRunningLoop = self.get();
         if (self != nullptr) {
             Mutex::Autolock lock(mutex_);
             pending = !queue_.empty();
@@ -189,11 +222,23 @@ void EventLoop::ProcessEventLoop() {
                 }
             }
             ReEnqueueEvent(entry);
-            Mutex::Autolock lock(mutex_);
-            current_ = nullptr;
-            pending = !queue_.empty();
-            sleeping_ = !pending;
+            bool due = false;
+            {
+                Mutex::Autolock lock(mutex_);
+                current_ = nullptr;
+                pending = !queue_.empty();
+                sleeping_ = !pending;
+                due = pending && queue_.front().targetTime <= Now();
+            }
+            if (!deferredWakes_.empty() && (!due || Now() - deferredSinceNs_ >= kMaxDeferredWakeNs)) {
+                WakeDeferred();
+            }
         }
+        // Nothing owed survives the turn: the loop may sleep next.
+        if (self != nullptr) {
+            WakeDeferred();
+        }
+        tRunningLoop = nullptr;
     }
     // An entry due beyond the longest sleep is looked at again after that sleep.
     unsigned long timeoutMs = waitNs == kWaitForever ? kWaitForever : std::min(waitNs / kNsPerMs, kWaitForever);

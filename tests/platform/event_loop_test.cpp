@@ -176,6 +176,40 @@ TEST_F(EventLoopTest, EntryQueuedAsTheLoopFallsAsleepStillRuns) {
     }
 }
 
+// A loop with a backlog may hold back the wake of a loop it hands entries to, but only for about
+// a millisecond, not until its backlog is gone; and an entry that never ends (an event source's
+// read loop) has no backlog behind it, so what it hands over is never held back.
+TEST_F(EventLoopTest, HandOverFromABusyLoopWaitsBoundedlyAndFromAnEndlessEntryNotAtAll) {
+    sp<EventLoop> receiver = new EventLoop("receiver_loop");
+    receiver->StartLoop();
+    constexpr int kBacklog = 2000;
+    std::atomic<int> producerRan{0};
+    std::atomic<int> receivedAfter{-1};
+    Gate gate;  // holds the producer until its whole backlog is queued
+    loop_->AddTask([&gate] { gate.Wait(); });
+    loop_->AddTask([&] { receiver->AddTask([&] { receivedAfter = producerRan.load(); }); });
+    for (int i = 0; i < kBacklog; i++) {
+        loop_->AddTask([&producerRan] {
+            usleep(1000);  // an entry's work
+            producerRan++;
+        });
+    }
+    gate.Open();
+    ASSERT_TRUE(WaitUntil([&] { return receivedAfter >= 0; }, std::chrono::seconds(60)));
+    EXPECT_LT(receivedAfter, kBacklog / 2);
+    ASSERT_TRUE(WaitUntil([&] { return producerRan == kBacklog; }, std::chrono::seconds(60)));
+
+    auto answered = std::make_shared<std::promise<void>>();
+    std::future<void> answer = answered->get_future();
+    std::promise<bool> heard;
+    loop_->AddTask([&] {
+        receiver->AddTask([answered] { answered->set_value(); });
+        heard.set_value(answer.wait_for(std::chrono::seconds(10)) == std::future_status::ready);
+    });
+    EXPECT_TRUE(heard.get_future().get());
+    receiver->StopLoop();
+}
+
 TEST_F(EventLoopTest, NewEntryWakesSleepingLoopAndStopLeavesEntriesUnrunTillDestructionReleasesThem) {
     std::string stat = "/proc/self/task/" + std::to_string(Drain()) + "/stat";
     std::atomic<int> ran{0};
