@@ -143,6 +143,40 @@ void BM_ProcessFaultEvent(benchmark::State& state) {
     database->Close();
 }
 
+// The storage loop under load: 5,000 ids in turn, all within quota, sharing transactions of
+// the group-commit size as a backlog makes them. The cost per event on the storage thread.
+void BM_StoreUnderLoad(benchmark::State& state) {
+    constexpr int kIds = 5000;
+    BenchFolder folder;
+    std::ofstream(folder.Path() + "event_quota.xml")
+            << "<?xml version=\"1.0\"?>\n<Quota><" << kOsVersion << "><Domain name=\"load\" eventMin=\"" << kEventId
+            << "\" eventMax=\"" << kEventId + kIds << "\" dailyCnt=\"2000000000\"/></" << kOsVersion << "></Quota>\n";
+    FakePluginContext context(folder.Path(), folder.Path());
+    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
+    helper->Init(&context, "event.db", kOsVersion);
+    sp<EventDatabase> database = EventDatabase::getInstance();
+    uint64_t day = helper->GetDbStartTime();
+    int64_t n = 0;
+    for (auto _ : state) {
+        sp<Event> event = new Event("bench");
+        event->eventType = 2;
+        event->eventId = kEventId + static_cast<uint32_t>(n % kIds);
+        event->happenTime = day + 100 + n++ / 1000;
+        event->SetValue("param_list", "{\"load\":1}");
+        database->BeginEvent();
+        helper->ProcessFaultEvent(event);
+        if (database->EndEvent()) {
+            database->Commit();
+        }
+        if (!event->GetValue("dropReason").empty()) {
+            state.SkipWithError("event dropped");
+            break;
+        }
+    }
+    database->Commit();
+    database->Close();
+}
+
 int IgnoreRows(void*, int, char**, char**) {
     return 0;
 }
@@ -248,6 +282,7 @@ void BM_StoreStreamMemory(benchmark::State& state) {
 // growth curve at 0, 100,000 and 1,000,000 rows of event_info.
 BENCHMARK(BM_ProcessFaultEvent)->Arg(0)->Arg(100000)->Arg(1000000)->Iterations(500)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_DirectSql)->Arg(0)->Arg(100000)->Arg(1000000)->Iterations(500)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_StoreUnderLoad)->Iterations(50000)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_StoreStreamMemory)->Iterations(1)->Unit(benchmark::kMillisecond);
 
 }  // namespace
