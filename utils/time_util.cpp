@@ -1,12 +1,17 @@
 #include "utils/time_util.h"
 
+#include <stdlib.h>
 #include <sys/time.h>
 #include <time.h>
+
+#include <string>
 
 namespace android {
 namespace Orvane {
 namespace TimeUtil {
 namespace {
+
+constexpr int64_t kKnownDayNs = 60LL * 1000000000;
 
 // Local midnight of `seconds` through the reentrant conversions; false when either fails.
 bool LocalMidnight(time_t seconds, time_t& midnight) {
@@ -56,9 +61,31 @@ int64_t GetZeroTimestampSec(int64_t seconds) {
     if (seconds < 1) {
         return seconds;
     }
+    // Asked at every stored event, while mktime may look at the zone file at each call (glibc
+    // does, without TZ): the day found last is kept per thread, for one zone setting and at most
+    // a minute, so that a change of the zone file or of its property still reaches it.
+    struct KnownDay {
+        int64_t start = 0;
+        int64_t end = 0;
+        int64_t foundNs = 0;
+        std::string zone;
+    };
+    thread_local KnownDay known;
+    const char* zone = getenv("TZ");
+    int64_t now = GetNanoSecondSinceSystemStart();
+    if (seconds >= known.start && seconds < known.end && now - known.foundNs < kKnownDayNs &&
+        known.zone == (zone != nullptr ? zone : "")) {
+        return known.start;
+    }
     time_t midnight;
     if (!LocalMidnight(static_cast<time_t>(seconds), midnight) || midnight <= 0) {
         return ((seconds + 28800) / 86400) * 86400 - 28800;
+    }
+    // Any time 26 hours after a midnight lies in the next day, however long daylight saving
+    // makes this one.
+    time_t next;
+    if (midnight <= seconds && LocalMidnight(midnight + 26 * 3600, next) && next > seconds) {
+        known = {midnight, next, now, zone != nullptr ? zone : ""};
     }
     return midnight;
 }

@@ -43,4 +43,26 @@ TEST(TimeUtilTest, MidnightsInSeveralZonesAndClockUnits) {
     EXPECT_TRUE(us > 1600000000ull * 1000000 && s >= us / 1000000 && s <= us / 1000000 + 5) << us << " " << s;
 }
 
+// Midnights asked for in a row, as storage asks at every event: every half hour over four days
+// around the switch to summer time, with the zone changed between any two questions.
+TEST(TimeUtilTest, MidnightsInARowFollowTheDayAndTheZone) {
+    auto reference = [](int64_t seconds) {
+        time_t t = static_cast<time_t>(seconds);
+        struct tm local;
+        localtime_r(&t, &local);
+        local.tm_hour = local.tm_min = local.tm_sec = 0;
+        local.tm_isdst = -1;
+        return static_cast<int64_t>(mktime(&local));
+    };
+    constexpr int64_t kFrom = 1711670400;  // 2024-03-29 00:00 UTC
+    for (int64_t t = kFrom; t < kFrom + 4 * 86400; t += 1800) {
+        for (const char* zone : {"CET-1CEST,M3.5.0,M10.5.0/3", "<+0530>-5:30", "CET-1CEST,M3.5.0,M10.5.0/3"}) {
+            SetZone(zone);
+            ASSERT_EQ(reference(t), TimeUtil::GetZeroTimestampSec(t)) << zone << " at " << t;
+        }
+    }
+    unsetenv("TZ");
+    tzset();
+}
+
 }  // namespace android::Orvane
