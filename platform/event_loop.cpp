@@ -118,6 +118,10 @@ uint64_t EventLoop::Enqueue(LoopEvent entry) {
 }
 
 bool EventLoop::DeferWake(EventLoop* receiver) {
+    if (!deferredWakes_.empty() && Now() - deferredSinceNs_ >= kMaxDeferredWakeNs) {
+        WakeDeferred();  // an entry that keeps handing over does not hold the wakes past the bound
+        return false;
+    }
     if (!HasDueEntry()) {
         return false;
     }

@@ -177,8 +177,9 @@ TEST_F(EventLoopTest, EntryQueuedAsTheLoopFallsAsleepStillRuns) {
 }
 
 // A loop with a backlog may hold back the wake of a loop it hands entries to, but only for about
-// a millisecond, not until its backlog is gone; and an entry that never ends (an event source's
-// read loop) has no backlog behind it, so what it hands over is never held back.
+// a millisecond, not until its backlog is gone, nor for the rest of an entry that keeps handing
+// over; and an entry that never ends (an event source's read loop) has no backlog behind it, so
+// what it hands over is never held back.
 TEST_F(EventLoopTest, HandOverFromABusyLoopWaitsBoundedlyAndFromAnEndlessEntryNotAtAll) {
     sp<EventLoop> receiver = new EventLoop("receiver_loop");
     receiver->StartLoop();
@@ -207,6 +208,25 @@ TEST_F(EventLoopTest, HandOverFromABusyLoopWaitsBoundedlyAndFromAnEndlessEntryNo
         heard.set_value(answer.wait_for(std::chrono::seconds(10)) == std::future_status::ready);
     });
     EXPECT_TRUE(heard.get_future().get());
+
+    // An entry that goes on handing over while its loop has a backlog holds no wake past the
+    // bound either: its next hand-over releases the earlier ones.
+    auto reached = std::make_shared<std::atomic<bool>>(false);
+    std::promise<bool> released;
+    Gate held;
+    loop_->AddTask([&held] { held.Wait(); });
+    loop_->AddTask([&] {
+        receiver->AddTask([reached] { *reached = true; });
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+        while (!*reached && std::chrono::steady_clock::now() < deadline) {
+            usleep(2000);              // the entry's work
+            receiver->AddTask([] {});  // and its next hand-over
+        }
+        released.set_value(reached->load());
+    });
+    loop_->AddTask([] {});  // the backlog behind that entry
+    held.Open();
+    EXPECT_TRUE(released.get_future().get());
     receiver->StopLoop();
 }
 
