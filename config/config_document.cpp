@@ -45,18 +45,25 @@ struct TakenStamp {
 
 Mutex gStampMutex;
 std::map<std::string, TakenStamp> gStamps GUARDED_BY(gStampMutex);
+// Counts the Forget calls, so that a stamp taken across one is not kept.
+uint64_t gForgotten GUARDED_BY(gStampMutex) = 0;
 
 FileStamp RecentStamp(const std::string& path) {
     int64_t now = TimeUtil::GetNanoSecondSinceSystemStart();
+    uint64_t forgotten = 0;
     {
         Mutex::Autolock lock(gStampMutex);
         auto found = gStamps.find(path);
         if (found != gStamps.end() && now - found->second.takenNs < kStampLifeNs) {
             return found->second.stamp;
         }
+        forgotten = gForgotten;
     }
     FileStamp stamp = FileUtil::GetFileStamp(path);
     Mutex::Autolock lock(gStampMutex);
+    if (forgotten != gForgotten) {
+        return stamp;
+    }
     if (gStamps.size() >= kMaxStamps) {
         gStamps.clear();
     }
@@ -133,6 +140,7 @@ DocumentChoice ConfigDocument::Choose(const DocumentFolders& folders, const std:
 void ConfigDocument::Forget() {
     Mutex::Autolock lock(gStampMutex);
     gStamps.clear();
+    gForgotten++;
 }
 
 }  // namespace Orvane
