@@ -109,7 +109,7 @@ TEST_F(EventQuotaXmlParserTest, ReadsAgainOnlyWhenTheChosenCopyOrTheSectionChang
     EXPECT_EQ(logs.Count(ANDROID_LOG_WARN, "StartParserXml parse xml file failed " + absent.configDir), 1u);
     EXPECT_EQ(stats.Value("config.read_failed.event_quota.xml"), 1u);
     ASSERT_TRUE(WriteDocument("<Q><unknown><Summary defDailyCnt=\"44\"/></unknown></Q>",
-                                                 absent.configDir + "event_quota.xml"));
+                              absent.configDir + "event_quota.xml"));
     EXPECT_EQ(Quota(960000001, absent)[0], 44);
 }
 

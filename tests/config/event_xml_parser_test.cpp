@@ -14,8 +14,8 @@
 #include <gtest/gtest.h>
 
 #include "tests/common/log_capture.h"
-#include "utils/string_util.h"
 #include "tests/common/write_document.h"
+#include "utils/string_util.h"
 
 namespace android::Orvane {
 namespace {
@@ -173,8 +173,7 @@ TEST_F(EventXmlParserTest, CopyInForceIsReadAndItsChangeDropsTheCache) {
     EXPECT_EQ(level(914000001), 3);
     Write(Entry(914000001, "FaultLevel=\"CRITICAL\""), cloudDir);  // pushed again
     EXPECT_EQ(level(914000001), 4);
-    ASSERT_TRUE(WriteDocument("<Events><Event id=\"914000001\" FaultLevel=\"2\">",
-                                                 cloudDir + "event.xml"));
+    ASSERT_TRUE(WriteDocument("<Events><Event id=\"914000001\" FaultLevel=\"2\">", cloudDir + "event.xml"));
     EXPECT_EQ(level(914000001), 1);  // a broken push is passed over
     EXPECT_EQ(stats.Value("config.cloud_rejected.event.xml"), 1u);
 

@@ -101,8 +101,8 @@ TEST(HostileDocumentsTest, NeitherCrashNorLeakNorPassAsAPushedCopy) {
         DaemonStats stats;
         DocumentFolders folders(cld, sys, &stats);
         ASSERT_TRUE(WriteDocument(Quota("<Summary defDailyCnt=\"5\"/>"), sys + "event_quota.xml"));
-        ASSERT_TRUE(WriteDocument(
-                Catalogue("<Event id=\"" + std::to_string(kId) + "\" FaultLevel=\"2\"/>"), sys + "event.xml"));
+        ASSERT_TRUE(WriteDocument(Catalogue("<Event id=\"" + std::to_string(kId) + "\" FaultLevel=\"2\"/>"),
+                                  sys + "event.xml"));
         ASSERT_TRUE(WriteDocument(hostile.quota, cld + "event_quota.xml"));
         ASSERT_TRUE(WriteDocument(hostile.catalogue, cld + "event.xml"));
         EXPECT_EQ(quota->GetEventQuota(folders, "unknown", kId).dailyCnt, hostile.wellFormed ? 7u : 5u);

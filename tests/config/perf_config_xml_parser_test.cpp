@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
-
 #include <android-base/file.h>
 #include <gtest/gtest.h>
 

@@ -14,7 +14,6 @@
 namespace android::Orvane {
 namespace {
 
-
 std::string Policy(const std::string& levels, const std::string& body = "") {
     return "<PrivacyPolicy>" + levels + body + "</PrivacyPolicy>\n";
 }

@@ -12,9 +12,9 @@
 #include "tests/common/envelope_opener.h"
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
+#include "tests/common/write_document.h"
 #include "tests/storage/storage_test_util.h"
 #include "utils/dev_info.h"
-#include "tests/common/write_document.h"
 
 namespace android::Orvane {
 namespace {

@@ -22,8 +22,8 @@
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
 #include "tests/common/test_data.h"
-#include "utils/json_util.h"
 #include "tests/common/write_document.h"
+#include "utils/json_util.h"
 
 namespace android::Orvane {
 namespace {

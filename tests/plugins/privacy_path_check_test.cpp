@@ -13,8 +13,8 @@
 
 #include "tests/common/fake_plugin_context.h"
 #include "tests/common/log_capture.h"
-#include "utils/zip_pack.h"
 #include "tests/common/write_document.h"
+#include "utils/zip_pack.h"
 
 namespace android::Orvane {
 namespace {
@@ -34,8 +34,8 @@ protected:
     }
     void WritePolicy(const std::string& paths) {
         ASSERT_TRUE(WriteDocument("<PrivacyPolicy><Levels switchOn=\"1\" switchOff=\"1\"/><LogPaths>" + paths +
-                                              "</LogPaths></PrivacyPolicy>",
-                                      root_ + "/etc/tmp"));
+                                          "</LogPaths></PrivacyPolicy>",
+                                  root_ + "/etc/tmp"));
         ASSERT_EQ(rename((root_ + "/etc/tmp").c_str(), (root_ + "/etc/privacy_policy.xml").c_str()), 0);
     }
     std::string Read(const android::base::unique_fd& fd) {
