@@ -22,7 +22,7 @@ public:
     void Check(const char* operation) {
 #if defined(ORVANE_THREAD_CHECKS)
         // gettid is a system call, and Check runs at every statement of the storage loop.
-        thread_local const pid_t self = gettid();
+        thread_local pid_t self = gettid();
         pid_t owner = 0;
         if (!owner_.compare_exchange_strong(owner, self) && owner != self) {
             OLOG_AS(ANDROID_LOG_FATAL, operation, "%s called on thread %d, owned by thread %d", self, owner);
