@@ -68,13 +68,14 @@ int64_t GetZeroTimestampSec(int64_t seconds) {
         int64_t start = 0;
         int64_t end = 0;
         int64_t foundNs = 0;
+        bool zoneSet = false;  // an unset TZ (the zone file) and an empty one (UTC) differ
         std::string zone;
     };
     thread_local KnownDay known;
     const char* zone = getenv("TZ");
     int64_t now = GetNanoSecondSinceSystemStart();
     if (seconds >= known.start && seconds < known.end && now - known.foundNs < kKnownDayNs &&
-        known.zone == (zone != nullptr ? zone : "")) {
+        known.zoneSet == (zone != nullptr) && (zone == nullptr || known.zone == zone)) {
         return known.start;
     }
     time_t midnight;
@@ -85,7 +86,7 @@ int64_t GetZeroTimestampSec(int64_t seconds) {
     // makes this one.
     time_t next;
     if (midnight <= seconds && LocalMidnight(midnight + 26 * 3600, next) && next > seconds) {
-        known = {midnight, next, now, zone != nullptr ? zone : ""};
+        known = {midnight, next, now, zone != nullptr, zone != nullptr ? zone : ""};
     }
     return midnight;
 }
