@@ -58,10 +58,12 @@ public:
 // producers wake the looper after releasing it, and only when the loop may sleep: a loop still
 // running entries looks at the queue again before it sleeps, so waking it is a wasted syscall.
 // A loop that hands an entry to another loop while entries of its own are due defers that wake
-// until it has run them, for at most kMaxDeferredWakeNs (or the rest of its current entry, when
-// that is longer): under load a loop then passes its events on a batch per wake, not with one
-// thread switch each, and without a backlog it wakes the receiver at once. Synchronous entries
-// are never deferred.
+// until it has run them, for at most kMaxDeferredWakeNs: under load a loop then passes its events
+// on a batch per wake, not with one thread switch each, and without a backlog it wakes the
+// receiver at once. A wake owed is paid after each entry once it is that old, or at the entry's
+// next hand-over; so an entry that hands over once and then runs on (or never ends, as an event
+// source's read loop) while entries wait behind it holds that wake until it returns. Synchronous
+// entries are never deferred.
 // StartLoop and StopLoop belong to the loop's owner and must not race each other. Always hold a
 // loop through sp<EventLoop>.
 //
