@@ -15,6 +15,8 @@
 #include <android/log.h>
 #include <libxml/xmlerror.h>
 
+#include "config/config_document.h"
+
 namespace android {
 namespace Orvane {
 namespace FuzzDocuments {
@@ -52,7 +54,8 @@ inline std::string Folder(const char* name) {
 }
 
 // Puts content at path as a new file (a new inode, so that readers see a new version however
-// fast the inputs come), as a zip archive holding it under `entry` when that is not empty.
+// fast the inputs come), as a zip archive holding it under `entry` when that is not empty, and
+// announces it as a config-update does, so that the next choice looks at the file at once.
 inline void Replace(const std::string& path, const std::string& content, const std::string& entry = "") {
     std::string next = path + ".next";
     if (entry.empty()) {
@@ -74,6 +77,7 @@ inline void Replace(const std::string& path, const std::string& content, const s
     if (rename(next.c_str(), path.c_str()) != 0) {
         abort();
     }
+    ConfigDocument::Forget();
 }
 
 // The numbers that follow `key` in text (at most `limit` of them), as ids the input names.
