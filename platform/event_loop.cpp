@@ -122,8 +122,11 @@ bool EventLoop::DeferWake(EventLoop* receiver) {
         WakeDeferred();  // an entry that keeps handing over does not hold the wakes past the bound
         return false;
     }
-    if (!HasDueEntry()) {
-        return false;
+    {
+        Mutex::Autolock lock(mutex_);
+        if (!HasDueEntryLocked()) {
+            return false;
+        }
     }
     if (deferredWakes_.empty()) {
         deferredSinceNs_ = Now();
@@ -137,8 +140,7 @@ bool EventLoop::DeferWake(EventLoop* receiver) {
     return true;
 }
 
-bool EventLoop::HasDueEntry() {
-    Mutex::Autolock lock(mutex_);
+bool EventLoop::HasDueEntryLocked() {
     return !queue_.empty() && queue_.front().targetTime <= Now();
 }
 
@@ -232,7 +234,7 @@ void EventLoop::ProcessEventLoop() {
                 current_ = nullptr;
                 pending = !queue_.empty();
                 sleeping_ = !pending;
-                due = pending && queue_.front().targetTime <= Now();
+                due = !deferredWakes_.empty() && HasDueEntryLocked();
             }
             if (!deferredWakes_.empty() && (!due || Now() - deferredSinceNs_ >= kMaxDeferredWakeNs)) {
                 WakeDeferred();

@@ -112,7 +112,7 @@ private:
     // On this loop's thread: true when `receiver`'s wake is left for WakeDeferred, because
     // entries of this loop are due.
     bool DeferWake(EventLoop* receiver);
-    bool HasDueEntry();
+    bool HasDueEntryLocked() REQUIRES(mutex_);
     void WakeDeferred();
 
     const std::string name_;
