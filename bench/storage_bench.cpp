@@ -56,6 +56,31 @@ private:
     std::string path_;
 };
 
+// The event database of a folder, opened by the storage bookkeeping as the storage plugin opens
+// it, and closed when this goes.
+struct OpenStore {
+    explicit OpenStore(const std::string& folder) : context(folder, folder) {
+        helper->Init(&context, "event.db", kOsVersion);
+        day = helper->GetDbStartTime();
+    }
+    ~OpenStore() { database->Close(); }
+
+    FakePluginContext context;
+    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
+    sp<EventDatabase> database = EventDatabase::getInstance();
+    uint64_t day = 0;  // the day the database counts in
+};
+
+// A fault event as the kernel source makes it.
+sp<Event> FaultEvent(uint32_t id, uint64_t happenTime, const std::string& params) {
+    sp<Event> event = new Event("bench");
+    event->eventType = 2;
+    event->eventId = id;
+    event->happenTime = happenTime;
+    event->SetValue("param_list", params);
+    return event;
+}
+
 // Fills event_info with `rows` events of 5,000 other ids over the last 60 days, in one
 // transaction: a store that has grown, while the benchmark's own id has only the rows of today
 // that the run adds (on a phone its daily quota bounds them).
@@ -97,11 +122,7 @@ void MakeDatabase(const std::string& folder, int64_t rows) {
         CopyToDisk(kept, folder + "event.db");
         return;
     }
-    FakePluginContext context(folder, folder);
-    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-    helper->Init(&context, "event.db", kOsVersion);
-    uint64_t day = helper->GetDbStartTime();
-    EventDatabase::getInstance()->Close();
+    uint64_t day = OpenStore(folder).day;
     Prefill(folder + "event.db", rows, day);
     if (rows >= 100000) {
         CopyToDisk(folder + "event.db", kept);
@@ -113,24 +134,16 @@ void MakeDatabase(const std::string& folder, int64_t rows) {
 void BM_ProcessFaultEvent(benchmark::State& state) {
     BenchFolder folder;
     MakeDatabase(folder.Path(), state.range(0));
-    FakePluginContext context(folder.Path(), folder.Path());
-    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-    helper->Init(&context, "event.db", kOsVersion);
-    sp<EventDatabase> database = EventDatabase::getInstance();
-    uint64_t day = helper->GetDbStartTime();
+    OpenStore store(folder.Path());
     int64_t n = 0;
     double commitSeconds = 0;
     for (auto _ : state) {
-        sp<Event> event = new Event("bench");
-        event->eventType = 2;
-        event->eventId = kEventId;
-        event->happenTime = day + 100;
-        event->SetValue("param_list", "{\"n\":" + std::to_string(n++) + "}");
-        database->BeginEvent();
-        helper->ProcessFaultEvent(event);
-        database->EndEvent();
+        sp<Event> event = FaultEvent(kEventId, store.day + 100, "{\"n\":" + std::to_string(n++) + "}");
+        store.database->BeginEvent();
+        store.helper->ProcessFaultEvent(event);
+        store.database->EndEvent();
         auto commitStart = std::chrono::steady_clock::now();
-        database->Commit();
+        store.database->Commit();
         commitSeconds += std::chrono::duration<double>(std::chrono::steady_clock::now() - commitStart).count();
         if (!event->GetValue("dropReason").empty()) {
             state.SkipWithError("event dropped");
@@ -138,9 +151,8 @@ void BM_ProcessFaultEvent(benchmark::State& state) {
         }
     }
     state.counters["commit_us"] = commitSeconds * 1e6 / static_cast<double>(std::max<int64_t>(n, 1));
-    state.counters["commits_per_event"] = static_cast<double>(context.GetStats().Value("storage.db.commits")) /
+    state.counters["commits_per_event"] = static_cast<double>(store.context.GetStats().Value("storage.db.commits")) /
                                           static_cast<double>(std::max<int64_t>(n, 1));
-    database->Close();
 }
 
 // The storage loop under load: 5,000 ids in turn, all within quota, sharing transactions of
@@ -151,30 +163,23 @@ void BM_StoreUnderLoad(benchmark::State& state) {
     std::ofstream(folder.Path() + "event_quota.xml")
             << "<?xml version=\"1.0\"?>\n<Quota><" << kOsVersion << "><Domain name=\"load\" eventMin=\"" << kEventId
             << "\" eventMax=\"" << kEventId + kIds << "\" dailyCnt=\"2000000000\"/></" << kOsVersion << "></Quota>\n";
-    FakePluginContext context(folder.Path(), folder.Path());
-    sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-    helper->Init(&context, "event.db", kOsVersion);
-    sp<EventDatabase> database = EventDatabase::getInstance();
-    uint64_t day = helper->GetDbStartTime();
+    OpenStore store(folder.Path());
     int64_t n = 0;
     for (auto _ : state) {
-        sp<Event> event = new Event("bench");
-        event->eventType = 2;
-        event->eventId = kEventId + static_cast<uint32_t>(n % kIds);
-        event->happenTime = day + 100 + n++ / 1000;
-        event->SetValue("param_list", "{\"load\":1}");
-        database->BeginEvent();
-        helper->ProcessFaultEvent(event);
-        if (database->EndEvent()) {
-            database->Commit();
+        sp<Event> event =
+                FaultEvent(kEventId + static_cast<uint32_t>(n % kIds), store.day + 100 + n / 1000, "{\"load\":1}");
+        n++;
+        store.database->BeginEvent();
+        store.helper->ProcessFaultEvent(event);
+        if (store.database->EndEvent()) {
+            store.database->Commit();
         }
         if (!event->GetValue("dropReason").empty()) {
             state.SkipWithError("event dropped");
             break;
         }
     }
-    database->Commit();
-    database->Close();
+    store.database->Commit();
 }
 
 int IgnoreRows(void*, int, char**, char**) {
@@ -187,15 +192,7 @@ void BM_DirectSql(benchmark::State& state) {
     BenchFolder folder;
     std::string path = folder.Path() + "event.db";
     MakeDatabase(folder.Path(), state.range(0));
-    uint64_t day = 0;
-    {
-        // The day the database counts in, read as the helper reads it.
-        FakePluginContext context(folder.Path(), folder.Path());
-        sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-        helper->Init(&context, "event.db", kOsVersion);
-        day = helper->GetDbStartTime();
-        EventDatabase::getInstance()->Close();
-    }
+    uint64_t day = OpenStore(folder.Path()).day;
     sqlite3_soft_heap_limit64(102400);
     sqlite3* db = nullptr;
     sqlite3_open(path.c_str(), &db);
@@ -257,19 +254,12 @@ void BM_StoreStreamMemory(benchmark::State& state) {
     long before = StatusKiB("VmHWM:");
     for (auto _ : state) {
         BenchFolder folder;
-        FakePluginContext context(folder.Path(), folder.Path());
-        sp<EventDatabaseHelper> helper = new EventDatabaseHelper();
-        helper->Init(&context, "event.db", kOsVersion);
-        uint64_t day = helper->GetDbStartTime();
+        OpenStore store(folder.Path());
         for (int i = 0; i < 10000; i++) {
-            sp<Event> event = new Event("bench");
-            event->eventType = 2;
-            event->eventId = kEventId + i % 50;
-            event->happenTime = day + 100 + i;
-            event->SetValue("param_list", "{\"pkg\":\"com.example.app\",\"n\":" + std::to_string(i % 500) + "}");
-            helper->ProcessFaultEvent(event);
+            store.helper->ProcessFaultEvent(
+                    FaultEvent(kEventId + i % 50, store.day + 100 + i,
+                               "{\"pkg\":\"com.example.app\",\"n\":" + std::to_string(i % 500) + "}"));
         }
-        EventDatabase::getInstance()->Close();
     }
     state.counters["VmHWM_before_KiB"] = static_cast<double>(before);
     state.counters["VmHWM_KiB"] = static_cast<double>(StatusKiB("VmHWM:"));
