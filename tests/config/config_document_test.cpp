@@ -15,10 +15,6 @@
 namespace android::Orvane {
 namespace {
 
-void Write(const std::string& path, const std::string& content) {
-    ASSERT_TRUE(WriteDocument(content, path));
-}
-
 // The cloud copy wins only while it parses; a broken one is reported once per version and
 // counted; every rewrite is seen at the next choice, so readers reload after an update.
 TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) {
@@ -31,8 +27,8 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
     EXPECT_EQ(none.directory, sys);
     EXPECT_EQ(none.stamp.size, -1);
 
-    Write(sys + "a.xml", "<a/>");
-    Write(cld + "a.xml", "<a><b></a>");  // not well-formed
+    ASSERT_TRUE(WriteDocument("<a/>", sys + "a.xml"));
+    ASSERT_TRUE(WriteDocument("<a><b></a>", cld + "a.xml"));  // not well-formed
     for (int i = 0; i < 3; ++i) {
         DocumentChoice choice = ConfigDocument::Choose({cld, sys, &stats}, "a.xml");
         EXPECT_EQ(choice.path, sys + "a.xml");
@@ -41,17 +37,17 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
     EXPECT_EQ(capture.Count(ANDROID_LOG_WARN, "does not parse"), 1u) << capture.Dump();
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 1u);
 
-    Write(cld + "a.xml", "<a><b/></a>\n");  // the update: a new version that parses
+    ASSERT_TRUE(WriteDocument("<a><b/></a>\n", cld + "a.xml"));  // the update: a new version that parses
     DocumentChoice pushed = ConfigDocument::Choose({cld, sys, &stats}, "a.xml");
     EXPECT_TRUE(pushed.fromCloud);
     EXPECT_EQ(pushed.path, cld + "a.xml");
     EXPECT_EQ(pushed.stamp, FileUtil::GetFileStamp(cld + "a.xml"));
 
-    Write(cld + "a.xml", "");  // an empty copy is not a document
+    ASSERT_TRUE(WriteDocument("", cld + "a.xml"));  // an empty copy is not a document
     EXPECT_FALSE(ConfigDocument::Choose({cld, sys, &stats}, "a.xml").fromCloud);
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 2u);
     // Entities are never loaded: a copy that needs one to parse is passed over.
-    Write(cld + "a.xml", "<!DOCTYPE a [<!ENTITY x SYSTEM \"file:///etc/passwd\">]><a>&x;</a>");
+    ASSERT_TRUE(WriteDocument("<!DOCTYPE a [<!ENTITY x SYSTEM \"file:///etc/passwd\">]><a>&x;</a>", cld + "a.xml"));
     EXPECT_FALSE(ConfigDocument::Choose({cld, sys, &stats}, "a.xml").fromCloud);
     EXPECT_EQ(stats.Value("config.cloud_rejected.a.xml"), 3u);
 }
@@ -61,7 +57,7 @@ TEST(ConfigDocumentTest, CloudCopyFirstWhileItParsesAndEachVersionIsJudgedOnce) 
 TEST(ConfigDocumentTest, UnannouncedChangeIsSeenSoon) {
     TemporaryDir system, cloud;
     std::string sys = std::string(system.path) + "/", cld = std::string(cloud.path) + "/";
-    Write(sys + "a.xml", "<a/>");
+    ASSERT_TRUE(WriteDocument("<a/>", sys + "a.xml"));
     ASSERT_FALSE(ConfigDocument::Choose({cld, sys, nullptr}, "a.xml").fromCloud);
     ASSERT_TRUE(base::WriteStringToFile("<a><b/></a>", cld + "a.xml"));
     auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);

@@ -14,10 +14,6 @@
 namespace android::Orvane {
 namespace {
 
-void Write(const std::string& path, const std::string& content) {
-    ASSERT_TRUE(WriteDocument(content, path));
-}
-
 std::string Describe(const std::vector<PerfResourceConfig>& resources) {
     std::string text;
     for (const PerfResourceConfig& r : resources) {
@@ -33,7 +29,7 @@ std::string Describe(const std::vector<PerfResourceConfig>& resources) {
 TEST(PerfConfigXmlParserTest, BadValuesLeaveOutTheirResourceOnly) {
     TemporaryDir dir;
     std::string path = std::string(dir.path) + "/perf_config.xml";
-    Write(path, R"(<?xml version="1.0"?>
+    ASSERT_TRUE(WriteDocument(R"(<?xml version="1.0"?>
 <Settings><Other><Resource name="cpu" someStallUs="1" windowUs="2000000"/></Other>
 <PerfConfig>
   <Resource name="memory" someStallUs="300000" fullStallUs="100000" windowUs="2000000" coolDownSec="60" topCount="3"/>
@@ -53,7 +49,8 @@ TEST(PerfConfigXmlParserTest, BadValuesLeaveOutTheirResourceOnly) {
   <Resource someStallUs="1" windowUs="2000000"/>
   <Trigger name="io"/>
   <Resource name="io" fullStallUs="10000000" windowUs="10000000" coolDownSec="4294967295" topCount="0"/>
-</PerfConfig></Settings>)");
+</PerfConfig></Settings>)",
+                              path));
     DaemonStats stats;
     LogCapture capture;
     std::vector<PerfResourceConfig> resources;
@@ -68,7 +65,8 @@ TEST(PerfConfigXmlParserTest, BadValuesLeaveOutTheirResourceOnly) {
     EXPECT_TRUE(capture.Contains(ANDROID_LOG_WARN, "resource \"disk\" left out: name is not cpu, memory or io"));
 
     // A document that breaks off keeps what came before the break, and says so.
-    Write(path, R"(<PerfConfig><Resource name="io" someStallUs="1" windowUs="2000000"/><Resource name=)");
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig><Resource name="io" someStallUs="1" windowUs="2000000"/><Resource name=)",
+                              path));
     ASSERT_FALSE(PerfConfigXmlParser::Read(path, resources, &stats));
     EXPECT_EQ("io:1/0/2000000/600/5 ", Describe(resources));
     ASSERT_FALSE(PerfConfigXmlParser::Read(std::string(dir.path) + "/missing.xml", resources, &stats));
@@ -98,14 +96,16 @@ TEST(PerfConfigXmlParserTest, DocumentFollowsTheChosenCopyAndItsVersions) {
     EXPECT_FALSE(document.Refresh(context));
 
     std::string systemCopy = std::string(system.path) + "/perf_config.xml";
-    Write(systemCopy, R"(<PerfConfig><Resource name="cpu" someStallUs="5" windowUs="2000000"/></PerfConfig>)");
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig><Resource name="cpu" someStallUs="5" windowUs="2000000"/></PerfConfig>)",
+                              systemCopy));
     ASSERT_TRUE(document.Refresh(context));
     EXPECT_EQ(systemCopy, document.Path());
     EXPECT_EQ("cpu:5/0/2000000/600/5 ", Describe(document.Resources()));
     EXPECT_FALSE(document.Refresh(context));
 
     // A rewrite of the same size is still a new version.
-    Write(systemCopy, R"(<PerfConfig><Resource name="cpu" someStallUs="6" windowUs="2000000"/></PerfConfig>)");
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig><Resource name="cpu" someStallUs="6" windowUs="2000000"/></PerfConfig>)",
+                              systemCopy));
     struct timespec later[2] = {{0, UTIME_OMIT}, {time(nullptr) + 5, 0}};
     ASSERT_EQ(0, utimensat(AT_FDCWD, systemCopy.c_str(), later, 0));
     ConfigDocument::Forget();
@@ -113,7 +113,8 @@ TEST(PerfConfigXmlParserTest, DocumentFollowsTheChosenCopyAndItsVersions) {
     EXPECT_EQ("cpu:6/0/2000000/600/5 ", Describe(document.Resources()));
 
     std::string cloudCopy = std::string(cloud.path) + "/perf_config.xml";
-    Write(cloudCopy, R"(<PerfConfig><Resource name="io" someStallUs="7" windowUs="4000000"/></PerfConfig>)");
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig><Resource name="io" someStallUs="7" windowUs="4000000"/></PerfConfig>)",
+                              cloudCopy));
     ASSERT_TRUE(document.Refresh(context));
     EXPECT_EQ(cloudCopy, document.Path());
     EXPECT_EQ("io:7/0/4000000/600/5 ", Describe(document.Resources()));

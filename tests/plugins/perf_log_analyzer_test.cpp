@@ -30,10 +30,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-void Write(const std::string& path, const std::string& content) {
-    ASSERT_TRUE(WriteDocument(content, path));
-}
-
 // Whether a thread of this process carries the name.
 bool HasThread(const std::string& name) {
     std::unique_ptr<DIR, int (*)(DIR*)> tasks(opendir("/proc/self/task"), closedir);
@@ -118,11 +114,12 @@ TEST(PerfLogAnalyzerTest, IdleWithOneWarningWhereNothingCanBeWatched) {
 
     // An old kernel has no pressure files; one that refuses writes is stood in for by a file
     // that cannot be opened for writing.
-    Write(std::string(config.path) + "/perf_config.xml", R"(<PerfConfig>
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig>
         <Resource name="cpu" someStallUs="1000000" windowUs="2000000"/>
         <Resource name="memory" someStallUs="300000" fullStallUs="100000" windowUs="2000000" coolDownSec="60"/>
         <Resource name="io" someStallUs="600000" windowUs="2000000" topCount="2"/>
-    </PerfConfig>)");
+    </PerfConfig>)",
+                              std::string(config.path) + "/perf_config.xml"));
     ASSERT_EQ(0, mkdir((std::string(pressure.path) + "/cpu").c_str(), 0755));
     sp<PerfLogAnalyzer> plugin = Load(context, std::string(pressure.path) + "/");
     ASSERT_TRUE(capture.WaitFor(ANDROID_LOG_WARN, "pressure stall triggers unavailable")) << capture.Dump();
@@ -139,7 +136,8 @@ TEST(PerfLogAnalyzerTest, IdleWithOneWarningWhereNothingCanBeWatched) {
     EXPECT_NE(std::string::npos, dump.find("io: triggers some 600000 2000000 refused; cool-down 600 s; top 2")) << dump;
 
     // An update that leaves nothing valid is reported as such.
-    Write(std::string(config.path) + "/perf_config.xml", R"(<PerfConfig><Resource name="gpu"/></PerfConfig>)");
+    ASSERT_TRUE(WriteDocument(R"(<PerfConfig><Resource name="gpu"/></PerfConfig>)",
+                              std::string(config.path) + "/perf_config.xml"));
     sp<Event> update = new Event("test");
     update->eventType = 1;
     update->eventId = 104;
@@ -164,8 +162,10 @@ TEST(PerfLogAnalyzerTest, RealTriggerBecomesFaultEventAndCoolsDown) {
     FakePluginContext context(work.path, std::string(config.path) + "/");
     std::string document = std::string(config.path) + "/perf_config.xml";
     constexpr int kCoolDownSec = 6;
-    Write(document, R"(<PerfConfig><Resource name="cpu" someStallUs="100000" windowUs="2000000" coolDownSec=")" +
-                            std::to_string(kCoolDownSec) + R"(" topCount="3"/></PerfConfig>)");
+    ASSERT_TRUE(
+            WriteDocument(R"(<PerfConfig><Resource name="cpu" someStallUs="100000" windowUs="2000000" coolDownSec=")" +
+                                  std::to_string(kCoolDownSec) + R"(" topCount="3"/></PerfConfig>)",
+                          document));
     LogCapture capture;
     sp<PerfLogAnalyzer> plugin = Load(context, "/proc/pressure/");
     ASSERT_TRUE(capture.WaitFor(ANDROID_LOG_INFO, "watching 1 of 1 triggers")) << capture.Dump();
@@ -230,7 +230,9 @@ TEST(PerfLogAnalyzerTest, RealTriggerBecomesFaultEventAndCoolsDown) {
     EXPECT_NE(std::string::npos, dump.find("cpu: last pressure some avg10=")) << dump;
 
     // A new version of the document re-arms at the configuration update.
-    Write(document, R"(<PerfConfig><Resource name="memory" fullStallUs="2000000" windowUs="2000000"/></PerfConfig>)");
+    ASSERT_TRUE(WriteDocument(
+            R"(<PerfConfig><Resource name="memory" fullStallUs="2000000" windowUs="2000000"/></PerfConfig>)",
+            document));
     sp<Event> update = new Event("test");
     update->eventType = 1;
     update->eventId = 104;
